@@ -1,0 +1,16 @@
+# What every target of the project is compiled with.
+add_library(ox_options INTERFACE)
+target_compile_options(ox_options INTERFACE
+  -Wall -Wextra -Wpedantic -Wconversion -Wshadow -Werror)
+target_compile_definitions(ox_options INTERFACE
+  _GNU_SOURCE
+  # Files over 2 GB and times after 2038 on 32-bit machines.
+  _FILE_OFFSET_BITS=64
+  _TIME_BITS=64)
+target_link_libraries(ox_options INTERFACE Threads::Threads ${CMAKE_DL_LIBS})
+
+if(OX_SANITIZE)
+  target_compile_options(ox_options INTERFACE
+    -fsanitize=${OX_SANITIZE} -fno-sanitize-recover=all -fno-omit-frame-pointer)
+  target_link_options(ox_options INTERFACE -fsanitize=${OX_SANITIZE})
+endif()

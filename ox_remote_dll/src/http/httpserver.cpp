@@ -93,11 +93,13 @@ bool oxHttpServer::Start() {
     const std::string address = Settings()->webAddress;
     m_messageLog.Error("Starting server: connecting to %s on port %d.",
                        address.empty() ? "local host" : address.c_str(), static_cast<int>(m_port));
+    // Before the listener runs: where it ends at once on an error, the state that it leaves must not be overwritten.
+    const int before = m_stopped.exchange(STATE_RUNNING);
     if (StartDaemon(address)) {
         m_listenPort = GetListenAddress().Port();
-        m_stopped = STATE_RUNNING;
         return true;
     }
+    m_stopped = before;
     CloseAccessLog();
     m_lastError = StartErrorNumber();
     if (m_lastError == EADDRINUSE) {

@@ -1,0 +1,186 @@
+#include "http/httpdaemon.h"
+
+#include <fcntl.h>
+#include <netinet/tcp.h>
+
+#include <cerrno>
+#include <new>
+
+#include "http/serverfixture.h"
+
+namespace {
+
+using oxHttpDaemonTest = ServerFixture;
+
+// Puts a failing function into the socket table for one test.
+template <typename Function>
+class Injected {
+public:
+    Injected(Function& entry, Function replacement) : m_entry(entry), m_before(entry) { entry = replacement; }
+    ~Injected() { m_entry = m_before; }
+    Injected(const Injected&) = delete;
+    Injected& operator=(const Injected&) = delete;
+
+private:
+    Function& m_entry;
+    Function m_before;
+};
+
+TEST_F(oxHttpDaemonTest, PortZeroLetsTheSystemChoose) {
+    settings.port = 0;
+    server->Configure(settings);
+    ASSERT_TRUE(server->StartDaemon("127.0.0.1"));
+    const std::uint16_t port = server->GetListenAddress().Port();
+    EXPECT_NE(port, 0);
+    EXPECT_NE(Ask(port, "GET / HTTP/1.0\r\n\r\n").find("home"), std::string::npos);
+}
+
+TEST_F(oxHttpDaemonTest, ConnectionsAreTakenAsSoonAsTheStartReturns) {
+    server->Configure(settings);
+    for (int i = 0; i < 200; ++i) {
+        ASSERT_TRUE(server->Start());
+        ASSERT_TRUE(Client(settings.port).Connected()) << i;
+        server->Stop();
+    }
+}
+
+TEST_F(oxHttpDaemonTest, CreateFailureIsSaid) {
+    const Injected failing(oxSocket::m_lpfnsocket, +[](int, int, int) {
+        errno = EMFILE;
+        return -1;
+    });
+    EXPECT_FALSE(Start());
+    EXPECT_EQ(server->GetDaemonState(), -2);
+    EXPECT_EQ(Count("Socket create failed: Too many open files (24)"), 1);
+    EXPECT_EQ(Count("Server unable to start. (error=24)"), 1);
+}
+
+TEST_F(oxHttpDaemonTest, OptionsAreSetAndTheirFailureIsIgnored) {
+    struct Call {
+        int level;
+        int name;
+        bool operator==(const Call&) const = default;
+    };
+    static std::vector<Call> calls;
+    calls.clear();
+    const Injected failing(oxSocket::m_lpfnsetsockopt, +[](int, int level, int name, const void*, socklen_t) {
+        calls.push_back({level, name});
+        errno = ENOPROTOOPT;
+        return -1;
+    });
+    ASSERT_TRUE(Start());
+    const std::vector<Call> expected = {{IPPROTO_TCP, TCP_NODELAY}, {SOL_SOCKET, SO_REUSEADDR},
+                                        {SOL_SOCKET, SO_KEEPALIVE}, {SOL_SOCKET, SO_LINGER}};
+    ASSERT_GE(calls.size(), expected.size());
+    EXPECT_EQ(std::vector<Call>(calls.begin(), calls.begin() + 4), expected);
+    server->Stop();
+}
+
+TEST_F(oxHttpDaemonTest, FailingListenEndsTheThreadOnErrorAndCanBeStartedAgain) {
+    {
+        const Injected failing(oxSocket::m_lpfnlisten, +[](int, int) {
+            errno = EADDRINUSE;
+            return -1;
+        });
+        ASSERT_TRUE(Start());
+        ASSERT_TRUE(WaitForMessage(" exiting."));
+    }
+    EXPECT_EQ(server->GetState(), oxHttpServer::STATE_ERROR);
+    EXPECT_EQ(server->GetDaemonState(), -2);
+    const auto lines = Messages();
+    ASSERT_EQ(lines.size(), 8u);
+    EXPECT_EQ(lines[4], "listen failed");
+    EXPECT_EQ(lines[5], "Server log closed.");
+    EXPECT_EQ(lines[6], "Daemon thread exiting on error.");
+    EXPECT_EQ(lines[7], "session thread 0x" + lines[3].substr(37) + " exiting.");
+    ASSERT_TRUE(server->Start());
+    EXPECT_EQ(server->GetState(), oxHttpServer::STATE_RUNNING);
+    Poke();
+}
+
+TEST_F(oxHttpDaemonTest, FirstSessionThatCannotBeMadeEndsTheThread) {
+    server->onMakeSession = [] { throw std::bad_alloc(); };
+    ASSERT_TRUE(Start());
+    ASSERT_TRUE(WaitForMessage("Daemon thread exiting on error."));
+    EXPECT_EQ(Count("1st session allocation failed"), 1);
+    EXPECT_EQ(server->GetState(), oxHttpServer::STATE_ERROR);
+}
+
+TEST_F(oxHttpDaemonTest, LaterSessionThatCannotBeMadeEndsTheThreadButNotTheConnection) {
+    std::atomic<int> made{0};
+    server->onMakeSession = [&] {
+        if (++made > 1)
+            throw std::bad_alloc();
+    };
+    ASSERT_TRUE(Start());
+    EXPECT_NE(Ask(settings.port, "GET / HTTP/1.0\r\n\r\n").find("home"), std::string::npos);
+    ASSERT_TRUE(WaitForMessage("Daemon thread exiting on error."));
+    const auto lines = Messages();
+    EXPECT_EQ(std::count(lines.begin(), lines.end(), "session allocation failed"), 1);
+}
+
+TEST_F(oxHttpDaemonTest, ConnectionsAreTraced) {
+    ASSERT_TRUE(Start());
+    Poke();
+    ASSERT_TRUE(WaitForMessage("accepting connection:", 2));
+    const auto lines = Messages();
+    const auto connected = std::find(lines.begin(), lines.end(), "HttpDaemon thread: connected to 127.0.0.1.");
+    ASSERT_NE(connected, lines.end());
+    EXPECT_EQ((connected + 1)->rfind("Adding user session 0x", 0), 0u);
+}
+
+TEST_F(oxHttpDaemonTest, FailingAcceptsAreReportedOnceASecondAndServiceReturns) {
+    static std::atomic<int> failures;
+    failures = 0;
+    Client* waiting = nullptr;
+    std::unique_ptr<Client> client;
+    {
+        const Injected failing(oxSocket::m_lpfnaccept, +[](int, sockaddr*, socklen_t*) {
+            ++failures;
+            errno = EMFILE;
+            return -1;
+        });
+        ASSERT_TRUE(Start());
+        client = std::make_unique<Client>(settings.port);
+        waiting = client.get();
+        waiting->Send("GET / HTTP/1.0\r\n\r\n");
+        ASSERT_TRUE(WaitForMessage("Socket::Accept error: Too many open files (24).", 2));
+        EXPECT_LT(failures, 3 * 12);  // three tries a round, rounds 100 ms apart and more
+    }
+    EXPECT_NE(waiting->ReadAll().find("home"), std::string::npos);
+}
+
+TEST_F(oxHttpDaemonTest, ClientThatLeavesBeforeItIsAcceptedLeavesNoLine) {
+    static std::atomic<int> aborted;
+    aborted = 0;
+    const Injected failing(oxSocket::m_lpfnaccept, +[](int descriptor, sockaddr* address, socklen_t* length) {
+        if (aborted++ % 2 == 0) {
+            errno = ECONNABORTED;
+            return -1;
+        }
+        return accept4(descriptor, address, length, SOCK_CLOEXEC);
+    });
+    ASSERT_TRUE(Start());
+    Poke();
+    Poke();
+    EXPECT_EQ(Count("Accept error"), 0);
+}
+
+TEST_F(oxHttpDaemonTest, AcceptedConnectionsAreCloseOnExec) {
+    ASSERT_TRUE(Start());
+    std::atomic<int> unguarded{0};
+    server->onRequest = [&](const oxRequest&) {
+        for (int descriptor = 3; descriptor < 200; ++descriptor) {
+            struct sockaddr_in peer{};
+            socklen_t length = sizeof peer;
+            if (getpeername(descriptor, reinterpret_cast<sockaddr*>(&peer), &length) == 0 &&
+                ntohs(peer.sin_port) != settings.port)
+                unguarded += (fcntl(descriptor, F_GETFD) & FD_CLOEXEC) == 0;
+        }
+        return std::make_unique<oxResource_Invalid>(Http::NOT_FOUND_404, nullptr);
+    };
+    EXPECT_NE(Ask(settings.port, "GET / HTTP/1.0\r\n\r\n").find("404"), std::string::npos);
+    EXPECT_EQ(unguarded, 0);
+}
+
+}  // namespace

@@ -27,9 +27,11 @@ inline std::uint16_t FreePort() {
 
 class Client {
 public:
-    // Connects at once; `Connected` tells.
-    explicit Client(std::uint32_t port, std::uint32_t address = INADDR_LOOPBACK) {
+    // Connects at once; `Connected` tells. A receive buffer other than 0 is that many bytes.
+    explicit Client(std::uint32_t port, std::uint32_t address = INADDR_LOOPBACK, int receiveBuffer = 0) {
         m_socket = UniqueFd(socket(AF_INET, SOCK_STREAM | SOCK_CLOEXEC, 0));
+        if (receiveBuffer != 0)
+            setsockopt(m_socket.Get(), SOL_SOCKET, SO_RCVBUF, &receiveBuffer, sizeof receiveBuffer);
         sockaddr_in to{};
         to.sin_family = AF_INET;
         to.sin_port = htons(static_cast<std::uint16_t>(port));

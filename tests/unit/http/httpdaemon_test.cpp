@@ -12,7 +12,7 @@ namespace {
 
 using oxHttpDaemonTest = ServerFixture;
 
-// Puts a failing function into the socket table for one test.
+// Puts a failing function into the socket table for one test. A server that uses it is stopped first.
 template <typename Function>
 class Injected {
 public:
@@ -131,23 +131,24 @@ TEST_F(oxHttpDaemonTest, ConnectionsAreTraced) {
 
 TEST_F(oxHttpDaemonTest, FailingAcceptsAreReportedOnceASecondAndServiceReturns) {
     static std::atomic<int> failures;
+    static std::atomic<bool> exhausted;
     failures = 0;
-    Client* waiting = nullptr;
-    std::unique_ptr<Client> client;
-    {
-        const Injected failing(oxSocket::m_lpfnaccept, +[](int, sockaddr*, socklen_t*) {
-            ++failures;
-            errno = EMFILE;
-            return -1;
-        });
-        ASSERT_TRUE(Start());
-        client = std::make_unique<Client>(settings.port);
-        waiting = client.get();
-        waiting->Send("GET / HTTP/1.0\r\n\r\n");
-        ASSERT_TRUE(WaitForMessage("Socket::Accept error: Too many open files (24).", 2));
-        EXPECT_LT(failures, 3 * 12);  // three tries a round, rounds 100 ms apart and more
-    }
-    EXPECT_NE(waiting->ReadAll().find("home"), std::string::npos);
+    exhausted = true;
+    const Injected failing(oxSocket::m_lpfnaccept, +[](int descriptor, sockaddr* address, socklen_t* length) {
+        if (!exhausted)
+            return accept4(descriptor, address, length, SOCK_CLOEXEC);
+        ++failures;
+        errno = EMFILE;
+        return -1;
+    });
+    ASSERT_TRUE(Start());
+    Client waiting(settings.port);
+    waiting.Send("GET / HTTP/1.0\r\n\r\n");
+    ASSERT_TRUE(WaitForMessage("Socket::Accept error: Too many open files (24).", 2));
+    EXPECT_LT(failures, 3 * 12);  // three tries a round, rounds 100 ms apart and more
+    exhausted = false;
+    EXPECT_NE(waiting.ReadAll().find("home"), std::string::npos);
+    server->Stop();
 }
 
 TEST_F(oxHttpDaemonTest, ClientThatLeavesBeforeItIsAcceptedLeavesNoLine) {
@@ -164,6 +165,7 @@ TEST_F(oxHttpDaemonTest, ClientThatLeavesBeforeItIsAcceptedLeavesNoLine) {
     Poke();
     Poke();
     EXPECT_EQ(Count("Accept error"), 0);
+    server->Stop();
 }
 
 TEST_F(oxHttpDaemonTest, AcceptedConnectionsAreCloseOnExec) {

@@ -12,9 +12,9 @@
 // A text file written line by line under one process-wide lock, each line stamped with the local time, with a numeric
 // debug level that filters lines. Level 0 silences the object altogether.
 //
-// Thread rules: any thread may write; lines of different threads and different objects never interleave. `Open`, `Close`,
-// `Attach` and assignment may be called while others write. The lock is plain: `Stamp` is called with it held and must not
-// log. A line that the level filters costs neither the lock nor the formatting.
+// Thread rules: any thread may write; lines of different threads and different objects never interleave. `Open`,
+// `Close`, `Attach` and assignment may be called while others write. The lock is plain: `Stamp` is called with it held
+// and must not log. A line that the level filters costs neither the lock nor the formatting.
 //
 // Errors: a file that cannot be opened is reported on standard error and everything written later is dropped. Nothing
 // throws.
@@ -34,13 +34,13 @@ public:
     virtual ~oxAuditFile();
 
     // Opens for one of the modes of fopen, closing what is open first. A name without "/" is taken in the default
-    // directory. With a stream (standard error, for the process's own log) that stream itself, and its descriptor, now write
-    // to the file; where that fails the stream stays as it was.
+    // directory. With a stream (standard error, for the process's own log) that stream itself, and its descriptor, now
+    // write to the file; where that fails the stream stays as it was.
     virtual bool Open(const char* name, const char* mode, std::FILE* stream = nullptr);
     // Flushes, closes the stream unless it is standard error, and forgets the echo.
     virtual void Close();
-    // One line, when the level admits it. A text that ends with a newline gets no second one in the file, but one more on
-    // the echo.
+    // One line, when the level admits it. A text that ends with a newline gets no second one in the file, but one more
+    // on the echo.
     virtual void Write(const char* text, int msgLevel);
     // One line whatever its level, unless the object's level is 0.
     virtual void Printf(const char* format, ...) __attribute__((format(printf, 2, 3)));
@@ -71,8 +71,8 @@ public:
     static void SetDefaultAudit(oxAuditFile* audit) { m_pDefaultAudit = audit; }
     static oxAuditFile* GetDefaultAudit() { return m_pDefaultAudit; }
 
-    // For the out-of-memory and terminate handlers: the line goes out with the stamp and without allocating, and is given up
-    // when the lock stays taken for a moment (the failing thread may hold it itself).
+    // For the out-of-memory and terminate handlers: the line goes out with the stamp and without allocating, and is
+    // given up when the lock stays taken for a moment (the failing thread may hold it itself).
     void WriteFromHandler(std::string_view text) noexcept;
 
 protected:
@@ -90,7 +90,7 @@ private:
     std::FILE* m_stream = nullptr;
     std::FILE* m_echo = nullptr;
     std::atomic<int> m_level;
-    int m_echoLevel = 7;     // nothing reads it
+    int m_echoLevel = 7;    // nothing reads it
     bool m_shared = false;  // the streams belong to the object that this one was copied from
 
     static char m_defPath[MAX_PATH_TEXT + 1];

@@ -9,6 +9,7 @@
 #include <utility>
 
 #include "platform/text.h"
+#include "platform/threadcache.h"
 
 // Sanitizers put several times the usual amount on the stack.
 #if defined(__SANITIZE_ADDRESS__) || defined(__SANITIZE_THREAD__)
@@ -55,6 +56,23 @@ std::string MThreadError::Text() const {
 struct MThread::Run {
     Run(Entry body, void* bodyArgument) : entry(body), argument(bodyArgument) {}
 
+    // The whole of the thread's work.
+    void Do() {
+        {
+            const std::scoped_lock lock(mutex);
+            id = CurrentId();
+            changed.Broadcast();
+        }
+        try {
+            entry(argument);
+        } catch (...) {
+            std::terminate();
+        }
+        const std::scoped_lock lock(mutex);
+        finished = true;
+        changed.Broadcast();
+    }
+
     // Exactly one caller gets true, and joins or detaches the thread.
     bool ClaimJoin() {
         const std::scoped_lock lock(mutex);
@@ -76,7 +94,7 @@ struct MThread::Run {
     bool joinClaimed = false;
 };
 
-MThread::MThread(Priority priority) : m_priority(priority) {}
+MThread::MThread(Priority priority, Kept kept) : m_priority(priority), m_kept(kept) {}
 
 MThread::~MThread() {
     const std::shared_ptr<Run> run = CurrentRun();
@@ -87,21 +105,37 @@ MThread::~MThread() {
 
 void* MThread::Main(void* argument) {
     const std::unique_ptr<std::shared_ptr<Run>> holder(static_cast<std::shared_ptr<Run>*>(argument));
-    Run& run = **holder;
-    {
-        const std::scoped_lock lock(run.mutex);
-        run.id = CurrentId();
-        run.changed.Broadcast();
-    }
-    try {
-        run.entry(run.argument);
-    } catch (...) {
-        std::terminate();
-    }
-    const std::scoped_lock lock(run.mutex);
-    run.finished = true;
-    run.changed.Broadcast();
+    (*holder)->Do();
     return nullptr;
+}
+
+int MThread::StartThread(pthread_t* thread, int detachState, void* (*entry)(void*), void* argument) {
+    ThreadAttributes attributes;
+    int error = attributes.Error();
+    if (error == 0)
+        error = pthread_attr_setstacksize(attributes.Get(), STACK_BYTES * STACK_FACTOR);
+    if (error == 0)
+        error = pthread_attr_setdetachstate(attributes.Get(), detachState);
+    if (error == 0)
+        error = pthread_create(thread, attributes.Get(), entry, argument);
+    return error;
+}
+
+int MThread::Launch(const std::shared_ptr<Run>& run, Kept kept) {
+    if (kept == Kept::Yes) {
+        // Never destroyed: kept threads wait in it until the process is gone.
+        static auto& cache = *new MThreadCache([](void* (*entry)(void*), void* argument) {
+            pthread_t thread;
+            return StartThread(&thread, PTHREAD_CREATE_DETACHED, entry, argument);
+        });
+        run->joinClaimed = true;  // there is no thread of its own to join
+        return cache.Start([run] { run->Do(); });
+    }
+    auto holder = std::make_unique<std::shared_ptr<Run>>(run);
+    const int error = StartThread(&run->thread, PTHREAD_CREATE_JOINABLE, &MThread::Main, holder.get());
+    if (error == 0)
+        static_cast<void>(holder.release());  // the thread's now
+    return error;
 }
 
 bool MThread::Create(Entry entry, void* argument) {
@@ -115,28 +149,18 @@ bool MThread::Create(Entry entry, void* argument) {
         if (m_run->ClaimJoin())
             pthread_join(m_run->thread, nullptr);
     }
-    ThreadAttributes attributes;
-    int error = attributes.Error();
-    if (error == 0)
-        error = pthread_attr_setstacksize(attributes.Get(), STACK_BYTES * STACK_FACTOR);
-    std::unique_ptr<std::shared_ptr<Run>> holder;
-    try {
-        holder = std::make_unique<std::shared_ptr<Run>>(std::make_shared<Run>(entry, argument));
-    } catch (const std::bad_alloc&) {
-        m_error = MThreadError(ENOMEM);
-        return false;
-    }
-    const std::shared_ptr<Run> run = *holder;
     m_cancelled.store(false);
-    if (error == 0)
-        error = pthread_create(&run->thread, attributes.Get(), &MThread::Main, holder.get());
-    if (error != 0) {
-        m_error = MThreadError(error);
-        return false;
+    int error;
+    try {
+        const auto run = std::make_shared<Run>(entry, argument);
+        error = Launch(run, m_kept);
+        if (error == 0)
+            m_run = run;
+    } catch (const std::bad_alloc&) {
+        error = ENOMEM;
     }
-    static_cast<void>(holder.release());  // the thread's now
-    m_run = run;
-    return true;
+    m_error = MThreadError(error);
+    return error == 0;
 }
 
 void MThread::Detach() {
@@ -209,7 +233,13 @@ unsigned MThread::Id() const {
 }
 
 unsigned MThread::CurrentId() {
-    return static_cast<unsigned>(gettid());
+    thread_local unsigned id = 0;
+    // A forked child runs on a copy of this thread's memory under another id.
+    static std::once_flag prepared;
+    std::call_once(prepared, [] { pthread_atfork(nullptr, nullptr, [] { id = 0; }); });
+    if (id == 0)
+        id = static_cast<unsigned>(gettid());
+    return id;
 }
 
 MThreadError MThread::LastError() const {

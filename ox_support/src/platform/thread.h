@@ -1,6 +1,7 @@
 // The platform's thread class: one object is one thread of control, which may be run again after it ended.
 #pragma once
 
+#include <pthread.h>
 #include <sys/types.h>
 
 #include <atomic>
@@ -47,7 +48,11 @@ public:
     // thousand threads in the 3 GB of a 32-bit process. A guard page lies below.
     static constexpr std::size_t STACK_BYTES = 1024 * 1024;
 
-    explicit MThread(Priority priority = Priority::Normal);
+    // With Kept::Yes the object's runs are done by threads that are kept for a moment after their work (MThreadCache);
+    // nothing else about the object changes. For short work that comes often.
+    enum class Kept { No, Yes };
+
+    explicit MThread(Priority priority = Priority::Normal, Kept kept = Kept::No);
     virtual ~MThread();
     MThread(const MThread&) = delete;
     MThread& operator=(const MThread&) = delete;
@@ -81,12 +86,15 @@ public:
 
 private:
     struct Run;  // what the object and its running thread share
+    static int Launch(const std::shared_ptr<Run>& run, Kept kept);
+    static int StartThread(pthread_t* thread, int detachState, void* (*entry)(void*), void* argument);
     static void* Main(void* argument);
     std::shared_ptr<Run> CurrentRun() const;
     bool WaitForRun(const std::optional<std::chrono::milliseconds>& limit);
     void SetError(int code);
 
     const Priority m_priority;
+    const Kept m_kept;
     mutable MMutex m_mutex;  // over the two below
     std::shared_ptr<Run> m_run;
     MThreadError m_error;

@@ -48,7 +48,8 @@ bool oxHttpDaemon::StartDaemon(const std::string& address) {
         socklen_t length = oxSockAddr::LENGTH;
         m_listeningSocket.GetSockName(m_listenAddress.Raw(), &length);
     }
-    // Clients may connect from here on, before the thread runs; an error is reported by the thread, which listens again.
+    // Clients may connect from here on, before the thread runs; an error is reported by the thread, which listens
+    // again.
     m_listeningSocket.Listen(BACKLOG);
     if (!Create(&oxHttpDaemon::CallHttpDaemonThread, this)) {
         m_startErrorNumber = LastError().Code();

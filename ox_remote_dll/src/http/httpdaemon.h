@@ -14,11 +14,12 @@
 class oxHttpServer;
 class oxHttpSession;
 
-// Owns the listening socket and runs the accept loop, which hands each connection to a session of its own after the server admitted it. It is
-// the base of the server object, so one object is both the server and its listener.
+// Owns the listening socket and runs the accept loop, which hands each connection to a session of its own after the
+// server admitted it. It is the base of the server object, so one object is both the server and its listener.
 //
-// Under load: connections wait in the system's queue of BACKLOG while the loop is busy. When accepting fails for lack of
-// descriptors or memory the loop pauses (ACCEPT_PAUSE_MIN, doubled up to ACCEPT_PAUSE_MAX) and logs one line per failed try.
+// Under load: connections wait in the system's queue of BACKLOG while the loop is busy. When accepting fails for lack
+// of descriptors or memory the loop pauses (ACCEPT_PAUSE_MIN, doubled up to ACCEPT_PAUSE_MAX) and logs one line per
+// failed try.
 class oxHttpDaemon : public MThread {
 public:
     enum DaemonState { STATE_ENDED = -1, STATE_FAILED = -2 };
@@ -33,13 +34,13 @@ public:
     oxHttpDaemon();
     ~oxHttpDaemon() override;
 
-    // Creates the socket, binds it to the address (empty: every local one) and the port, and starts the accepting thread. False with the
-    // reason in the message log and in `StartErrorNumber`; nothing is left half started.
+    // Creates the socket, binds it to the address (empty: every local one) and the port, and starts the accepting
+    // thread. False with the reason in the message log and in `StartErrorNumber`; nothing is left half started.
     virtual bool StartDaemon(const std::string& address);
     // Ends the accept loop and waits for its thread. Sessions go on.
     void StopDaemon();
-    // Waits until a connection can be accepted, sweeping timed-out sessions meanwhile. False when the listening socket was closed. For
-    // the listener thread.
+    // Waits until a connection can be accepted, sweeping timed-out sessions meanwhile. False when the listening socket
+    // was closed. For the listener thread.
     bool WaitForConnection();
 
     // STATE_ENDED after a normal exit, STATE_FAILED after a failed start or an exit on error.

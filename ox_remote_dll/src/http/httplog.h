@@ -27,8 +27,8 @@ public:
                                   std::time_t now, std::int32_t zone);
 };
 
-// The message log: error lines and lines with a level (3 server events, 5 sessions and threads, 7 connection tracing). Writes
-// nothing while it is not open.
+// The message log: error lines and lines with a level (3 server events, 5 sessions and threads, 7 connection tracing).
+// Writes nothing while it is not open.
 class oxHttpErrorLog : public oxAuditFile, public oxErrorSink {
 public:
     bool Open(const char* fileName);

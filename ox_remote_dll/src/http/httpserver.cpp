@@ -169,9 +169,8 @@ bool oxHttpServer::AdmitConnection(const oxHttpSession& newSession) {
     }
     if (count <= limit)
         return true;
-    m_messageLog.Error(
-        "HttpServer: connection refused from address: %s. Too many active connections from this address",
-        newSession.PeerAddress().Dotted().c_str());
+    m_messageLog.Error("HttpServer: connection refused from address: %s. Too many active connections from this address",
+                       newSession.PeerAddress().Dotted().c_str());
     return false;
 }
 
@@ -201,8 +200,8 @@ void oxHttpServer::Sweep(bool force, bool finished) {
     }
 }
 
-// Tells the sessions to end that are overdue, or all, and gives them a moment together: a sweep never takes longer than the limit,
-// however many there are.
+// Tells the sessions to end that are overdue, or all, and gives them a moment together: a sweep never takes longer than
+// the limit, however many there are.
 void oxHttpServer::StopAndWait(bool all) {
     const std::int64_t now = m_clock.MonotonicSeconds();
     const int timeout = Settings()->sessionTimeout;

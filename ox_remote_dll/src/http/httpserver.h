@@ -15,16 +15,16 @@
 #include "platform/mutex.h"
 #include "resources/resource.h"
 
-// Holds the settings of the web side, starts and stops the listener, owns the access log and the message log, and keeps the registry of
-// live sessions with their time-out and the limit per address.
+// Holds the settings of the web side, starts and stops the listener, owns the access log and the message log, and keeps
+// the registry of live sessions with their time-out and the limit per address.
 //
-// Life: constructed stopped. `Configure`, then `Start`; `Stop` ends the listener and lets running sessions finish, so a reset
-// loses no connection; `Close` also ends the sessions. Every derived class calls `Close` first in its destructor: sessions call
-// virtual operations.
+// Life: constructed stopped. `Configure`, then `Start`; `Stop` ends the listener and lets running sessions finish, so a
+// reset loses no connection; `Close` also ends the sessions. Every derived class calls `Close` first in its destructor:
+// sessions call virtual operations.
 //
-// Thread rules: `Configure`, `Start`, `Stop` and `Close` are for one thread at a time (the main thread). The session list is changed only by the
-// listener thread while it runs, and by the stopping thread after it ended. `CreateResource` runs on session threads, several at once.
-// `GetState` and `GetPort` may be read from anywhere.
+// Thread rules: `Configure`, `Start`, `Stop` and `Close` are for one thread at a time (the main thread). The session
+// list is changed only by the listener thread while it runs, and by the stopping thread after it ended.
+// `CreateResource` runs on session threads, several at once. `GetState` and `GetPort` may be read from anywhere.
 //
 // Errors: everything is reported in the message log and as a false result; nothing is thrown.
 class oxHttpServer : public oxHttpDaemon {
@@ -55,8 +55,8 @@ public:
 
     // Stops the listener; running sessions finish by themselves.
     void Stop();
-    // Stops everything and waits for the sessions, at most CLOSE_LIMIT. False when some have not ended by then: destroying
-    // the object would wait for them. Harmless when repeated.
+    // Stops everything and waits for the sessions, at most CLOSE_LIMIT. False when some have not ended by then:
+    // destroying the object would wait for them. Harmless when repeated.
     bool Close();
 
     void AddSession(std::list<std::unique_ptr<oxHttpSession>>& spare);

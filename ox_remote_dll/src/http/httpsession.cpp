@@ -17,7 +17,7 @@ bool IsPassing(int error) {
 }  // namespace
 
 oxHttpSession::oxHttpSession(oxHttpServer& server, std::uint32_t flags)
-    : m_server(server), m_flags(flags), m_lastActivity(server.Clock()) {
+    : MThread(Priority::Normal, Kept::Yes), m_server(server), m_flags(flags), m_lastActivity(server.Clock()) {
     static_cast<void>(m_flags);
 }
 
@@ -29,7 +29,8 @@ oxHttpSession::~oxHttpSession() {
 bool oxHttpSession::AcceptConnection(oxSocket& listening) {
     m_lastActivity.Touch();
     SetState(STATE_SERVING);
-    while (m_server.WaitForConnection() && listening.GetHandle() != -1) {
+    // Tried before waiting: on a busy server a connection is there already.
+    while (listening.GetHandle() != -1) {
         for (int attempt = 0; attempt < ACCEPT_TRIES && listening.GetHandle() != -1; ++attempt) {
             socklen_t length = oxSockAddr::LENGTH;
             if (listening.Accept(m_socket, m_peerAddress.Raw(), &length)) {
@@ -43,7 +44,7 @@ bool oxHttpSession::AcceptConnection(oxSocket& listening) {
             if (IsPassing(listening.ErrorCode()))
                 break;
         }
-        if (!IsPassing(listening.ErrorCode()))
+        if (!IsPassing(listening.ErrorCode()) || !m_server.WaitForConnection())
             break;
     }
     SetState(STATE_FINISHED);

@@ -16,14 +16,15 @@
 class oxHttpServer;
 class oxResource;
 
-// Accepts a connection for the listener, then, on its own thread, reads one request, sends one reply, writes the access-log line, closes the
-// connection and marks itself finished. The server's registry owns and destroys it.
+// Accepts a connection for the listener, then, on its own thread, reads one request, sends one reply, writes the
+// access-log line, closes the connection and marks itself finished. The server's registry owns and destroys it.
 //
 // Stopping a session (`Abort`) marks it as closing and shuts its connection down, so that whatever its thread waits for
 // returns; the thread then ends by itself, without sending anything more.
 //
-// Thread rules: `AcceptConnection`, `StartThread`, `Abort`, `Wait` and the destructor belong to the listener (or to whoever stops the
-// server after it); everything else happens on the session's thread. The readable state may be read from anywhere.
+// Thread rules: `AcceptConnection`, `StartThread`, `Abort`, `Wait` and the destructor belong to the listener (or to
+// whoever stops the server after it); everything else happens on the session's thread. The readable state may be read
+// from anywhere.
 class oxHttpSession : public MThread {
 public:
     enum State { STATE_NEW = 0, STATE_SERVING = -1, STATE_FINISHED = -2, STATE_CLOSING = -3 };
@@ -38,8 +39,8 @@ public:
     oxHttpSession(oxHttpServer& server, std::uint32_t flags);
     ~oxHttpSession() override;
 
-    // Waits for a connection and accepts it. False, with the listening socket's error code, when accepting failed or the
-    // listening socket was closed.
+    // Waits for a connection and accepts it. False, with the listening socket's error code, when accepting failed or
+    // the listening socket was closed.
     bool AcceptConnection(oxSocket& listening);
     // Starts serving the accepted connection. False when no thread could be started.
     bool StartThread();

@@ -6,8 +6,8 @@
 
 #include "platform/config.h"
 
-// Read from the settings file at every start, so a reset takes changed values. A started server holds one immutable snapshot; what
-// began under an earlier one ends under it.
+// Read from the settings file at every start, so a reset takes changed values. A started server holds one immutable
+// snapshot; what began under an earlier one ends under it.
 struct oxHttpSettings {
     static constexpr const char* m_sINI_KEY_WEB_ADDRESS = "WebAddress";
     static constexpr const char* m_sINI_KEY_WEB_PORT = "WebPort";
@@ -29,7 +29,7 @@ struct oxHttpSettings {
     static constexpr int DEFAULT_MAX_SESSIONS_PER_ADDRESS = 256;
 
     std::string webAddress;
-    std::uint32_t port = 0;  // 0: none was given
+    std::uint32_t port = 0;                     // 0: none was given
     int sessionTimeout = DEFAULT_USER_TIMEOUT;  // seconds, at least MIN_USER_TIMEOUT
     bool logErrors = true;
     std::string errorLogName = m_sERROR_LOG_NAME;
@@ -37,8 +37,8 @@ struct oxHttpSettings {
     std::string logFileName = m_sDEFAULT_LOG_FILE_NAME;
     bool noCache = false;
     int maxSessionsPerAddress = DEFAULT_MAX_SESSIONS_PER_ADDRESS;  // 0 or less: no limit
-    std::string homeDirectory;  // the access log lies here
-    std::string documentRoot;   // what browsers see
+    std::string homeDirectory;                                     // the access log lies here
+    std::string documentRoot;                                      // what browsers see
 
     // Reads the section of a loaded file; directories are taken as they are given.
     static oxHttpSettings Read(const oxConfig& config, const char* section, const std::string& homeDirectory,

@@ -33,7 +33,7 @@ public:
     // What a client still sends after the answer to a request that was not read to its end is dropped within these
     // limits; without it the system would reset the connection and the client would not see the answer.
     static constexpr std::chrono::milliseconds DROP_TIME{2000};
-    static constexpr std::size_t DROP_BYTES = 4 * 1024 * 1024;
+    static constexpr std::size_t DROP_BYTES = std::size_t{4} * 1024 * 1024;
     static constexpr std::size_t DROP_BLOCK = 16384;
 
     oxHttpSession(oxHttpServer& server, std::uint32_t flags);

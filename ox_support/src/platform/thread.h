@@ -46,7 +46,7 @@ public:
 
     // Enough for the largest buffers of a request and what PAM needs beside them, and small enough for some
     // thousand threads in the 3 GB of a 32-bit process. A guard page lies below.
-    static constexpr std::size_t STACK_BYTES = 1024 * 1024;
+    static constexpr std::size_t STACK_BYTES = std::size_t{1024} * 1024;
 
     // With Kept::Yes the object's runs are done by threads that are kept for a moment after their work (MThreadCache);
     // nothing else about the object changes. For short work that comes often.

@@ -39,6 +39,8 @@ bool oxHttpDaemon::StartDaemon(const std::string& address) {
         m_listeningSocket.SetSockOpt(SOL_SOCKET, SO_REUSEADDR, &on, sizeof on);
         m_listeningSocket.SetSockOpt(SOL_SOCKET, SO_KEEPALIVE, &on, sizeof on);
         m_listeningSocket.SetSockOpt(SOL_SOCKET, SO_LINGER, &lingering, sizeof lingering);
+        // Connections inherit it: a session sees that a slow client still reads each time this much has gone out.
+        m_listeningSocket.SetSockOpt(IPPROTO_TCP, TCP_NOTSENT_LOWAT, &UNSENT_BYTES, sizeof UNSENT_BYTES);
         // A client that goes away between the wait and the accept must not hold up the accept loop.
         m_listeningSocket.SetNonBlocking(true);
         if (!m_listeningSocket.Bind(m_listenAddress.Raw(), oxSockAddr::LENGTH, 1))

@@ -25,6 +25,9 @@ public:
     enum DaemonState { STATE_ENDED = -1, STATE_FAILED = -2 };
     static constexpr int BACKLOG = 128;
     static constexpr int LINGER_SECONDS = 30;
+    // What the system may hold unsent for one connection. Its own limit of some megabytes would take a slow client minutes to
+    // read, in which its session would count as idle.
+    static constexpr int UNSENT_BYTES = 256 * 1024;
     static constexpr std::chrono::milliseconds ACCEPT_PAUSE_MIN{100};
     static constexpr std::chrono::milliseconds ACCEPT_PAUSE_MAX{1000};
     static constexpr std::chrono::milliseconds ACCEPT_REPORT_INTERVAL{1000};

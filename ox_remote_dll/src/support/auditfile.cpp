@@ -131,6 +131,7 @@ bool oxAuditFile::Open(const char* name, const char* mode, std::FILE* stream) {
             std::this_thread::sleep_for(OPEN_PAUSE);
     }
     Error(error);
+    errno = error;
     return false;
 }
 

@@ -35,7 +35,7 @@ public:
 
     // Opens for one of the modes of fopen, closing what is open first. A name without "/" is taken in the default
     // directory. With a stream (standard error, for the process's own log) that stream itself, and its descriptor, now
-    // write to the file; where that fails the stream stays as it was.
+    // write to the file; where that fails the stream stays as it was. False with errno.
     virtual bool Open(const char* name, const char* mode, std::FILE* stream = nullptr);
     // Flushes, closes the stream unless it is standard error, and forgets the echo.
     virtual void Close();

@@ -115,6 +115,7 @@ bool oxDaemon::RunServer(bool debug) {
     ReceiveChildNotices();
     IgnoreLibrarySignal();
     FillStandardDescriptors();
+    GuardInheritedDescriptors();
     oxDetachOptions options;
     options.newSession = !debug;
     DetachProcess(options, m_program.Directory(), m_config, m_audit);

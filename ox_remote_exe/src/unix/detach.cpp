@@ -2,6 +2,7 @@
 
 #include <fcntl.h>
 #include <sys/stat.h>
+#include <sys/syscall.h>
 #include <unistd.h>
 
 #include <cerrno>
@@ -64,6 +65,13 @@ void FillStandardDescriptors() {
     } while ((descriptor >= 0 && descriptor <= STDERR_FILENO) || (descriptor < 0 && errno == EINTR));
     if (descriptor >= 0)
         close(descriptor);
+}
+
+void GuardInheritedDescriptors() {
+    // By number: not every C library that the program runs with has the call.
+    constexpr long CLOSE_RANGE = 436;
+    constexpr unsigned SET_CLOSE_ON_EXEC = 4;
+    syscall(CLOSE_RANGE, STDERR_FILENO + 1U, ~0U, SET_CLOSE_ON_EXEC);
 }
 
 void SilenceStandardStreams() {

@@ -21,6 +21,7 @@ oxHttpDaemon::~oxHttpDaemon() {
 
 bool oxHttpDaemon::StartDaemon(const std::string& address) {
     oxHttpErrorLog& log = m_server->MessageLog();
+    Wait();  // for the last lines of a listener that ended on an error
     m_addressText = address;
     m_stopRequested = false;
     m_stopWakeup.Clear();
@@ -31,7 +32,7 @@ bool oxHttpDaemon::StartDaemon(const std::string& address) {
         RootGuard root;  // a privileged port may be asked for
         if (!m_listeningSocket.Create(AF_INET, SOCK_STREAM, 0)) {
             root.Keep();  // as it always was: only the bound or refused port gives the right back
-            return FailStart("create");
+            return FailStart("create", m_listeningSocket.ErrorCode());
         }
         const int on = 1;
         const linger lingering{.l_onoff = 1, .l_linger = LINGER_SECONDS};
@@ -43,8 +44,11 @@ bool oxHttpDaemon::StartDaemon(const std::string& address) {
         m_listeningSocket.SetSockOpt(IPPROTO_TCP, TCP_NOTSENT_LOWAT, &UNSENT_BYTES, sizeof UNSENT_BYTES);
         // A client that goes away between the wait and the accept must not hold up the accept loop.
         m_listeningSocket.SetNonBlocking(true);
+        // A name that nobody knows leaves the address that is none, and the system would even listen on it.
+        if (!address.empty() && m_listenAddress.Address() == INADDR_NONE)
+            return FailStart("bind", EADDRNOTAVAIL);
         if (!m_listeningSocket.Bind(m_listenAddress.Raw(), oxSockAddr::LENGTH, 1))
-            return FailStart("bind");
+            return FailStart("bind", m_listeningSocket.ErrorCode());
     }
     if (port == 0) {
         socklen_t length = oxSockAddr::LENGTH;
@@ -63,8 +67,8 @@ bool oxHttpDaemon::StartDaemon(const std::string& address) {
     return true;
 }
 
-bool oxHttpDaemon::FailStart(const char* step) {
-    m_startErrorNumber = m_listeningSocket.ErrorCode();
+bool oxHttpDaemon::FailStart(const char* step, int error) {
+    m_startErrorNumber = error;
     m_server->MessageLog().Error("Socket %s failed: %s (%d)", step, GetLastErrorText(m_startErrorNumber),
                                  m_startErrorNumber);
     m_daemonState = STATE_FAILED;
@@ -127,8 +131,11 @@ void oxHttpDaemon::AcceptLoop() {
 void oxHttpDaemon::ServeConnections() {
     oxHttpErrorLog& log = m_server->MessageLog();
     log.Log(5, "Daemon thread started. Thread id = 0x%X", CurrentId());
-    if (!m_listeningSocket.Listen(BACKLOG))
+    if (!m_listeningSocket.Listen(BACKLOG)) {
+        if (m_stopRequested)
+            return;
         throw std::runtime_error("listen failed");
+    }
     log.Log(7, "HttpDaemon thread: waiting on %d connections.", BACKLOG);
 
     AcceptFailures failures;
@@ -143,12 +150,16 @@ void oxHttpDaemon::ServeConnections() {
                 HandleAcceptFailure(failures);
             spare.clear();
         } else {
-            failures = {};
-            if (m_server->AdmitConnection(session) && session.StartThread()) {
+            failures.pause = ACCEPT_PAUSE_MIN;
+            if (!m_server->AdmitConnection(session)) {
+                spare.clear();
+            } else if (!session.StartThread()) {
+                if (MayReport(failures))
+                    log.Error("Unable to create session thread, thread error = %d", session.LastError().Code());
+                spare.clear();
+            } else {
                 log.Log(7, "HttpDaemon thread: connected to %s.", session.PeerAddress().Dotted().c_str());
                 m_server->AddSession(spare);
-            } else {
-                spare.clear();
             }
         }
         if (m_stopRequested)
@@ -165,15 +176,22 @@ void oxHttpDaemon::MakeSpare(std::list<std::unique_ptr<oxHttpSession>>& spare, c
     }
 }
 
+bool oxHttpDaemon::MayReport(AcceptFailures& failures) {
+    const auto now = std::chrono::steady_clock::now();
+    if (now - failures.reported < ACCEPT_REPORT_INTERVAL)
+        return false;
+    failures.reported = now;
+    return true;
+}
+
 // Accepting fails for lack of descriptors or memory, and goes on failing until some are free: pause, or the loop would
 // spin, and report at most once a second.
 void oxHttpDaemon::HandleAcceptFailure(AcceptFailures& failures) {
     const int error = m_listeningSocket.ErrorCode();
-    const auto now = std::chrono::steady_clock::now();
-    if (error != EBADF && now - failures.reported >= ACCEPT_REPORT_INTERVAL) {
+    if (m_stopRequested)  // set before the stopping thread touches the socket and its error code
+        return;
+    if (error != EBADF && MayReport(failures))
         m_server->MessageLog().Error("Socket::Accept error: %s (%d).", GetLastErrorText(error), error);
-        failures.reported = now;
-    }
     if (WaitReadable(m_stopWakeup.Descriptor(), failures.pause) == Readiness::TimedOut)
         m_server->SweepTimedOutSessions();
     failures.pause = std::min(failures.pause * 2, ACCEPT_PAUSE_MAX);

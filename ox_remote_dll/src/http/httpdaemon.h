@@ -18,15 +18,15 @@ class oxHttpSession;
 // server admitted it. It is the base of the server object, so one object is both the server and its listener.
 //
 // Under load: connections wait in the system's queue of BACKLOG while the loop is busy. When accepting fails for lack
-// of descriptors or memory the loop pauses (ACCEPT_PAUSE_MIN, doubled up to ACCEPT_PAUSE_MAX) and logs one line per
-// failed try.
+// of descriptors or memory the loop pauses (ACCEPT_PAUSE_MIN, doubled up to ACCEPT_PAUSE_MAX) and logs at most one
+// line in ACCEPT_REPORT_INTERVAL.
 class oxHttpDaemon : public MThread {
 public:
     enum DaemonState { STATE_ENDED = -1, STATE_FAILED = -2 };
     static constexpr int BACKLOG = 128;
     static constexpr int LINGER_SECONDS = 30;
-    // What the system may hold unsent for one connection. Its own limit of some megabytes would take a slow client minutes to
-    // read, in which its session would count as idle.
+    // What the system may hold unsent for one connection. Its own limit of some megabytes would take a slow client
+    // minutes to read, in which its session would count as idle.
     static constexpr int UNSENT_BYTES = 256 * 1024;
     static constexpr std::chrono::milliseconds ACCEPT_PAUSE_MIN{100};
     static constexpr std::chrono::milliseconds ACCEPT_PAUSE_MAX{1000};
@@ -68,10 +68,11 @@ private:
     };
 
     static void* CallHttpDaemonThread(void* daemon);
-    bool FailStart(const char* step);
+    bool FailStart(const char* step, int error);
     void AcceptLoop();
     void ServeConnections();
     void MakeSpare(std::list<std::unique_ptr<oxHttpSession>>& spare, const char* failure);
+    static bool MayReport(AcceptFailures& failures);
     void HandleAcceptFailure(AcceptFailures& failures);
 
     oxSockAddr m_listenAddress;

@@ -34,8 +34,10 @@ void oxHttpServer::Configure(const oxHttpSettings& settings) {
         m_settings.swap(snapshot);
     }
     m_port = settings.port;
-    m_messageLog.Close();
-    if (settings.logErrors && m_messageLog.Open(settings.errorLogName.c_str()))
+    // Not closed first: sessions that outlive a reset may have something to say.
+    if (!settings.logErrors)
+        m_messageLog.Close();
+    else if (m_messageLog.Open(settings.errorLogName.c_str()))
         m_messageLog.SetDebugLevel(oxAuditFile::GetDefaultDebugLevel());
 }
 
@@ -113,6 +115,8 @@ bool oxHttpServer::Start() {
 }
 
 void oxHttpServer::Stop() {
+    if (m_stopped == STATE_ERROR)
+        Wait();  // for the last lines of a listener that ended on an error
     if (m_stopped != STATE_RUNNING)
         return;
     m_messageLog.Log(3, "Server stopping...");
@@ -122,7 +126,7 @@ void oxHttpServer::Stop() {
 
 bool oxHttpServer::Close() {
     Stop();
-    StopDaemon();  // where the listener ended by itself
+    StopDaemon();  // where it was started without the server
     if (!m_sessions.empty())
         m_messageLog.Log(3, "%d sessions not cleaned up on exit.", static_cast<int>(m_sessions.size()));
     const auto end = std::chrono::steady_clock::now() + CLOSE_LIMIT;
@@ -187,7 +191,7 @@ void oxHttpServer::Sweep(bool force, bool finished) {
     StopAndWait(force);
     for (auto position = m_sessions.begin(); position != m_sessions.end();) {
         const auto session = position++;
-        if ((*session)->WasAborted() && !force)
+        if ((*session)->WasStopped() && !force)
             m_messageLog.Log(5, "Session 0x%X has timed-out -- removing.", CurrentId());
         else if (force || (finished && (*session)->GetState() == oxHttpSession::STATE_FINISHED))
             m_messageLog.Log(5, "Removing user session 0x%X.", CurrentId());
@@ -210,14 +214,14 @@ void oxHttpServer::StopAndWait(bool all) {
     for (const auto& session : m_sessions) {
         const bool running = session->GetState() != oxHttpSession::STATE_FINISHED;
         if (all || (running && session->LastActivity() + timeout < now)) {
-            session->Abort();
+            session->StopSession(std::chrono::milliseconds(0));
             stopped = true;
         }
     }
     if (!stopped)
         return;
     for (const auto& session : m_sessions) {
-        if (session->WasAborted())
-            session->Wait(Left(end));
+        if (session->WasStopped())
+            session->StopSession(Left(end));
     }
 }

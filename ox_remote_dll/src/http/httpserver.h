@@ -24,7 +24,7 @@
 //
 // Thread rules: `Configure`, `Start`, `Stop` and `Close` are for one thread at a time (the main thread). The session
 // list is changed only by the listener thread while it runs, and by the stopping thread after it ended.
-// `CreateResource` runs on session threads, several at once. `GetState` and `GetPort` may be read from anywhere.
+// `CreateResource` runs on session threads, several at once. `GetState` and `GetListenPort` may be read from anywhere.
 //
 // Errors: everything is reported in the message log and as a false result; nothing is thrown.
 class oxHttpServer : public oxHttpDaemon {

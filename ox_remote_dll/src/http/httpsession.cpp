@@ -44,7 +44,11 @@ bool oxHttpSession::AcceptConnection(oxSocket& listening) {
             if (IsPassing(listening.ErrorCode()))
                 break;
         }
-        if (!IsPassing(listening.ErrorCode()) || !m_server.WaitForConnection())
+        // The system fails for lack of descriptors also when nobody waits to be accepted.
+        const bool failed = !IsPassing(listening.ErrorCode());
+        if (failed && listening.WaitReadable(std::chrono::milliseconds(0)) != Readiness::TimedOut)
+            break;
+        if (!m_server.WaitForConnection())
             break;
     }
     SetState(STATE_FINISHED);
@@ -59,7 +63,6 @@ bool oxHttpSession::StartThread() {
 }
 
 void oxHttpSession::Abort() {
-    m_aborted = true;
     {
         const std::scoped_lock lock(m_mutex);
         if (m_state != STATE_FINISHED)
@@ -69,7 +72,9 @@ void oxHttpSession::Abort() {
 }
 
 bool oxHttpSession::StopSession(std::chrono::milliseconds limit) {
-    Abort();
+    if (!m_stopped)
+        Abort();
+    m_stopped = true;
     return Wait(limit);
 }
 

@@ -19,10 +19,10 @@ class oxResource;
 // Accepts a connection for the listener, then, on its own thread, reads one request, sends one reply, writes the
 // access-log line, closes the connection and marks itself finished. The server's registry owns and destroys it.
 //
-// Stopping a session (`Abort`) marks it as closing and shuts its connection down, so that whatever its thread waits for
-// returns; the thread then ends by itself, without sending anything more.
+// Stopping a session (`StopSession`) marks it as closing and shuts its connection down, so that whatever its thread
+// waits for returns; the thread then ends by itself, without sending anything more.
 //
-// Thread rules: `AcceptConnection`, `StartThread`, `Abort`, `Wait` and the destructor belong to the listener (or to
+// Thread rules: `AcceptConnection`, `StartThread`, `StopSession` and the destructor belong to the listener (or to
 // whoever stops the server after it); everything else happens on the session's thread. The readable state may be read
 // from anywhere.
 class oxHttpSession : public MThread {
@@ -44,12 +44,11 @@ public:
     bool AcceptConnection(oxSocket& listening);
     // Starts serving the accepted connection. False when no thread could be started.
     bool StartThread();
-    // Tells the session to end; does not wait. A finished session stays finished.
-    void Abort();
-    // `Abort`, then waits for the thread, at most this long; true when it has ended.
+    // Tells the session to end and waits for its thread, at most this long; true when it has ended. A finished session
+    // stays finished. May be repeated to wait on.
     bool StopSession(std::chrono::milliseconds limit);
-    // Whether `Abort` was called; for the thread that calls it.
-    bool WasAborted() const { return m_aborted; }
+    // Whether `StopSession` was called; for the thread that calls it.
+    bool WasStopped() const { return m_stopped; }
 
     State GetState() const { return m_state.load(); }
     void SetState(State value);
@@ -60,6 +59,7 @@ public:
 
 private:
     static void* CallSessionThread(void* session);
+    void Abort();
     void Serve();
     void ServeRequest(oxRequest& request);
     std::unique_ptr<oxReply> ChooseReply(const oxRequest& request);
@@ -73,7 +73,7 @@ private:
     oxSocket m_socket;
     oxSockAddr m_peerAddress;
     std::atomic<bool> m_active{true};
-    bool m_aborted = false;
+    bool m_stopped = false;
     MMutex m_mutex;  // guards the changes of the state; never held over a call that may wait
     std::unique_ptr<oxResource> m_resource;
     std::unique_ptr<oxReply> m_reply;

@@ -6,8 +6,8 @@
 
 #include "platform/config.h"
 
-// Read from the settings file at every start, so a reset takes changed values. A started server holds one immutable
-// snapshot; what began under an earlier one ends under it.
+// Read from the settings file at every start, so a reset takes changed values. A server replaces them as a whole: what
+// reads them at that moment sees the old ones or the new ones.
 struct oxHttpSettings {
     static constexpr const char* m_sINI_KEY_WEB_ADDRESS = "WebAddress";
     static constexpr const char* m_sINI_KEY_WEB_PORT = "WebPort";

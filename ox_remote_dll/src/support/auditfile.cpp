@@ -48,7 +48,7 @@ bool Redirect(std::FILE* stream, UniqueFd file) {
     const int target = fileno(stream);
     if (file.Get() == target)  // the stream's descriptor was closed and the file took its number
         return fcntl(file.Release(), F_SETFD, 0) == 0;
-    return dup2(file.Get(), target) == target;
+    return DuplicateOnto(file.Get(), target);
 }
 
 void WriteVector(int descriptor, iovec* parts, int count) {
@@ -130,6 +130,10 @@ bool oxAuditFile::Open(const char* name, const char* mode, std::FILE* stream) {
         if (stream == nullptr)
             std::this_thread::sleep_for(OPEN_PAUSE);
     }
+    {
+        const std::scoped_lock lock(m_wrLock);
+        m_stream = nullptr;  // it may have been standard error
+    }
     Error(error);
     errno = error;
     return false;
@@ -184,12 +188,16 @@ void oxAuditFile::Printf(int msgLevel, const char* format, ...) {
 }
 
 void oxAuditFile::VPrintf(const char* format, va_list arguments) {
-    VPrintf(m_level.load(std::memory_order_relaxed), format, arguments);
+    if (m_level.load(std::memory_order_relaxed) != 0)
+        FormatLine(format, arguments);
 }
 
 void oxAuditFile::VPrintf(int msgLevel, const char* format, va_list arguments) {
-    if (!Admits(msgLevel))
-        return;
+    if (Admits(msgLevel))
+        FormatLine(format, arguments);
+}
+
+void oxAuditFile::FormatLine(const char* format, va_list arguments) {
     char text[MAX_TEXT + 1];
     if (std::vsnprintf(text, sizeof text, format, arguments) >= 0)
         WriteLine(text);
@@ -205,12 +213,14 @@ void oxAuditFile::WriteLine(std::string_view text) {
     if (m_echo != nullptr) {
         std::fwrite(text.data(), 1, text.size(), m_echo);
         std::fputc('\n', m_echo);
-        std::fflush(m_echo);
+        if (std::fflush(m_echo) != 0)
+            m_echo = nullptr;  // nobody listens any more
     }
 }
 
 void oxAuditFile::WriteFromHandler(std::string_view text) noexcept {
-    if (!Admits(m_level.load(std::memory_order_relaxed)) || !m_wrLock.try_lock_for(HANDLER_LOCK_LIMIT))
+    // The echo is left out: its stream has a lock of its own.
+    if (m_level.load(std::memory_order_relaxed) == 0 || !m_wrLock.try_lock_for(HANDLER_LOCK_LIMIT))
         return;
     const std::unique_lock lock(m_wrLock, std::adopt_lock);
     if (m_stream == nullptr)
@@ -241,8 +251,10 @@ bool oxAuditFile::IsOpen() {
 }
 
 oxAuditFile& oxAuditFile::operator=(const oxAuditFile& other) {
-    if (this != &other)
+    if (this != &other) {
+        oxAuditFile::Close();
         CopyFrom(other);
+    }
     return *this;
 }
 

@@ -52,7 +52,8 @@ public:
     virtual const char* Stamp();
     // A log on standard error does not count as open.
     virtual bool IsOpen();
-    // Shares the other's streams; the other goes on owning them, and must outlive the use of the copy.
+    // Closes what is open, then shares the other's streams; the other goes on owning them, and must outlive the use of
+    // the copy.
     virtual oxAuditFile& operator=(const oxAuditFile& other);
     // Closes what is open, then writes to the given stream.
     virtual void Attach(std::FILE* stream);
@@ -81,6 +82,7 @@ protected:
 
 private:
     bool Admits(int msgLevel) const;
+    void FormatLine(const char* format, va_list arguments) __attribute__((format(printf, 2, 0)));
     void WriteLine(std::string_view text);
     void CopyFrom(const oxAuditFile& other);
     bool Store(std::FILE* stream, const std::string& path);

@@ -115,7 +115,7 @@ bool oxDaemon::RunServer(bool debug) {
     ReceiveChildNotices();
     IgnoreLibrarySignal();
     FillStandardDescriptors();
-    GuardInheritedDescriptors();
+    DropInheritedDescriptors(!debug);
     oxDetachOptions options;
     options.newSession = !debug;
     DetachProcess(options, m_program.Directory(), m_config, m_audit);

@@ -5,8 +5,6 @@
 #include <sys/syscall.h>
 #include <unistd.h>
 
-#include <cerrno>
-
 #include "platform/file.h"
 #include "platform/text.h"
 #include "support/auditfile.h"
@@ -17,14 +15,6 @@ constexpr const char* NULL_DEVICE = "/dev/null";
 // Both are "no id" to some system call or other, the second where ids have 16 bits, and leave the process root.
 constexpr int NO_USER = -1;
 constexpr int NO_USER_16 = 65535;
-
-int Dup2(int from, int to) {
-    int result;
-    do {
-        result = dup2(from, to);
-    } while (result < 0 && (errno == EINTR || errno == EBUSY));
-    return result;
-}
 
 void StartSession(oxAuditFile& audit) {
     if (setsid() >= 0)
@@ -67,19 +57,19 @@ void FillStandardDescriptors() {
         close(descriptor);
 }
 
-void GuardInheritedDescriptors() {
+void DropInheritedDescriptors(bool close) {
     // By number: not every C library that the program runs with has the call.
     constexpr long CLOSE_RANGE = 436;
     constexpr unsigned SET_CLOSE_ON_EXEC = 4;
-    syscall(CLOSE_RANGE, STDERR_FILENO + 1U, ~0U, SET_CLOSE_ON_EXEC);
+    syscall(CLOSE_RANGE, STDERR_FILENO + 1U, ~0U, close ? 0U : SET_CLOSE_ON_EXEC);
 }
 
 void SilenceStandardStreams() {
     UniqueFd null = OpenFile(NULL_DEVICE, O_RDWR);
     if (!null)
         return;
-    Dup2(null.Get(), STDIN_FILENO);
-    Dup2(null.Get(), STDOUT_FILENO);
+    DuplicateOnto(null.Get(), STDIN_FILENO);
+    DuplicateOnto(null.Get(), STDOUT_FILENO);
     if (null.Get() <= STDERR_FILENO)
         null.Release();
 }

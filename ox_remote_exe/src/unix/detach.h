@@ -10,8 +10,9 @@ class oxAuditFile;
 // Opens "/dev/null" on those of the descriptors 0, 1 and 2 that are closed, so that no log, lock or socket gets their
 // numbers.
 void FillStandardDescriptors();
-// Keeps what the caller left open above them from the programs that the server starts.
-void GuardInheritedDescriptors();
+// Closes what the caller left open above them, for which it may wait; or, where the caller goes on watching the server,
+// only keeps it from the programs that the server starts.
+void DropInheritedDescriptors(bool close);
 // Points standard input and output at "/dev/null".
 void SilenceStandardStreams();
 

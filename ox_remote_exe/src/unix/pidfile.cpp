@@ -120,7 +120,7 @@ bool oxPidFile::Write(const std::string& title, pid_t pid) {
 }
 
 void oxPidFile::Remove() {
-    if (m_descriptor && IsStillTheFile())
-        unlink(m_path.c_str());
+    if (m_descriptor && IsStillTheFile() && unlink(m_path.c_str()) != 0)
+        m_audit.Printf("Error: can't delete %s: %s", m_path.c_str(), GetLastErrorText(errno));
     m_descriptor.Reset();
 }

@@ -2,6 +2,9 @@
 
 #include <unistd.h>
 
+#include <algorithm>
+#include <string_view>
+
 namespace {
 constexpr std::size_t DIRECTORY_BUFFER = 4095;
 }
@@ -14,7 +17,10 @@ oxFilename ProgramPath(const char* calledName) {
     char buffer[DIRECTORY_BUFFER];
     // Without a readable working directory "." still leads there.
     const std::string working = getcwd(buffer, sizeof buffer) != nullptr ? buffer : ".";
-    program.SetDirectory(oxFilename::NormalizePath(oxFilename::Join(working, directory)));
+    std::string_view relative = directory;
+    while (relative == "." || relative.starts_with("./"))
+        relative.remove_prefix(std::min<std::size_t>(2, relative.size()));
+    program.SetDirectory(oxFilename::Join(working, relative));
     return program;
 }
 

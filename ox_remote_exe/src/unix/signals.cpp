@@ -1,5 +1,7 @@
 #include "unix/signals.h"
 
+#include <unistd.h>
+
 #include <atomic>
 
 namespace {
@@ -55,8 +57,16 @@ void oxSignals::WaitHandshake() {
     m_semaphore.Wait();
 }
 
-bool oxSignals::IsChildNotice(const siginfo_t& info) {
-    return info.si_signo == SIGCHLD && info.si_code > 0;
+bool oxSignals::IsOwnNotice(const siginfo_t& info) {
+    switch (info.si_signo) {
+        case SIGCHLD:
+            return info.si_code > 0;
+        case SIGPIPE:
+        case SIGXFSZ:
+            return info.si_pid == getpid();
+        default:
+            return false;
+    }
 }
 
 void oxSignals::WaitLoop() {
@@ -69,8 +79,8 @@ void oxSignals::WaitLoop() {
     for (;;) {
         siginfo_t info{};
         const int number = sigtimedwait(&m_allSignals, &info, &limit);
-        // A child of the server's own may end at any time; only a signal that somebody sent is a command.
-        if (number < 0 || IsChildNotice(info))
+        // Only a signal that somebody sent is a command.
+        if (number < 0 || IsOwnNotice(info))
             continue;
         if (OnSignal(number))
             return;

@@ -52,8 +52,9 @@ public:
 
     // The process's signal object, or null.
     static oxSignals* Current();
-    // Whether the signal is the system's notice that a child of this process ended, and not sent by somebody.
-    static bool IsChildNotice(const siginfo_t& info);
+    // Whether the signal is the system's notice of something that the process itself met, and not sent by somebody: a
+    // child that ended, a write to a closed pipe or beyond the file-size limit.
+    static bool IsOwnNotice(const siginfo_t& info);
 
 private:
     static void* CallWaitLoop(void* signals);

@@ -31,15 +31,29 @@ UniqueFd OpenFile(const std::string& path, int flags, mode_t mode) {
     return UniqueFd(descriptor);
 }
 
+bool DuplicateOnto(int from, int to) {
+    int result;
+    do
+        result = dup2(from, to);
+    while (result < 0 && (errno == EINTR || errno == EBUSY));
+    return result == to;
+}
+
 bool ReadWholeFile(const std::string& path, std::string& content) {
     constexpr std::size_t BLOCK_BYTES = 16384;
     content.clear();
-    const UniqueFd file = OpenFile(path, O_RDONLY);
-    if (!file)
+    const UniqueFd file = OpenFile(path, O_RDONLY | O_NONBLOCK);
+    struct stat status;
+    if (!file || fstat(file.Get(), &status) != 0)
         return false;
+    // A pipe that nobody writes to would hold up the reader, a device may have no end.
+    if (!S_ISREG(status.st_mode)) {
+        errno = S_ISDIR(status.st_mode) ? EISDIR : EINVAL;
+        return false;
+    }
     std::array<char, BLOCK_BYTES> block;
     while (true) {
-        const ssize_t count = read(file.Get(), block.data(), block.size());  // EISDIR for a directory
+        const ssize_t count = read(file.Get(), block.data(), block.size());
         if (count > 0)
             content.append(block.data(), static_cast<std::size_t>(count));
         else if (count == 0)

@@ -33,7 +33,11 @@ inline constexpr mode_t PRIVATE_DIRECTORY_MODE = 0700;
 
 // open(2) with O_CLOEXEC and O_NOCTTY added, repeated when interrupted. An empty result leaves errno set.
 UniqueFd OpenFile(const std::string& path, int flags, mode_t mode = PRIVATE_FILE_MODE);
-// Reads the whole file. False with errno on failure; a directory fails with EISDIR.
+// dup2(2), repeated where it has to be: makes `to` another number of the same open file, without close-on-exec. False
+// with errno.
+bool DuplicateOnto(int from, int to);
+// Reads the whole of a regular file. False with errno on failure; a directory fails with EISDIR, a pipe or device with
+// EINVAL.
 bool ReadWholeFile(const std::string& path, std::string& content);
 // Writes all of the text to the descriptor, through short writes and interruptions. False with errno.
 bool WriteAll(int descriptor, const char* text, std::size_t length);

@@ -2,11 +2,15 @@
 
 #include <fcntl.h>
 #include <netinet/tcp.h>
+#include <sys/syscall.h>
 
 #include <cerrno>
+#include <list>
 #include <new>
+#include <thread>
 
 #include "http/serverfixture.h"
+#include "http/support_threads.h"
 
 namespace {
 
@@ -45,10 +49,11 @@ TEST_F(oxHttpDaemonTest, ConnectionsAreTakenAsSoonAsTheStartReturns) {
 }
 
 TEST_F(oxHttpDaemonTest, CreateFailureIsSaid) {
-    const Injected failing(oxSocket::m_lpfnsocket, +[](int, int, int) {
-        errno = EMFILE;
-        return -1;
-    });
+    const Injected failing(
+        oxSocket::m_lpfnsocket, +[](int, int, int) {
+            errno = EMFILE;
+            return -1;
+        });
     EXPECT_FALSE(Start());
     EXPECT_EQ(server->GetDaemonState(), -2);
     EXPECT_EQ(Count("Socket create failed: Too many open files (24)"), 1);
@@ -63,14 +68,15 @@ TEST_F(oxHttpDaemonTest, OptionsAreSetAndTheirFailureIsIgnored) {
     };
     static std::vector<Call> calls;
     calls.clear();
-    const Injected failing(oxSocket::m_lpfnsetsockopt, +[](int, int level, int name, const void*, socklen_t) {
-        calls.push_back({level, name});
-        errno = ENOPROTOOPT;
-        return -1;
-    });
+    const Injected failing(
+        oxSocket::m_lpfnsetsockopt, +[](int, int level, int name, const void*, socklen_t) {
+            calls.push_back({level, name});
+            errno = ENOPROTOOPT;
+            return -1;
+        });
     ASSERT_TRUE(Start());
-    const std::vector<Call> expected = {{IPPROTO_TCP, TCP_NODELAY}, {SOL_SOCKET, SO_REUSEADDR},
-                                        {SOL_SOCKET, SO_KEEPALIVE}, {SOL_SOCKET, SO_LINGER}};
+    const std::vector<Call> expected = {
+        {IPPROTO_TCP, TCP_NODELAY}, {SOL_SOCKET, SO_REUSEADDR}, {SOL_SOCKET, SO_KEEPALIVE}, {SOL_SOCKET, SO_LINGER}};
     ASSERT_GE(calls.size(), expected.size());
     EXPECT_EQ(std::vector<Call>(calls.begin(), calls.begin() + 4), expected);
     server->Stop();
@@ -78,10 +84,11 @@ TEST_F(oxHttpDaemonTest, OptionsAreSetAndTheirFailureIsIgnored) {
 
 TEST_F(oxHttpDaemonTest, FailingListenEndsTheThreadOnErrorAndCanBeStartedAgain) {
     {
-        const Injected failing(oxSocket::m_lpfnlisten, +[](int, int) {
-            errno = EADDRINUSE;
-            return -1;
-        });
+        const Injected failing(
+            oxSocket::m_lpfnlisten, +[](int, int) {
+                errno = EADDRINUSE;
+                return -1;
+            });
         ASSERT_TRUE(Start());
         ASSERT_TRUE(WaitForMessage(" exiting."));
     }
@@ -134,13 +141,14 @@ TEST_F(oxHttpDaemonTest, FailingAcceptsAreReportedOnceASecondAndServiceReturns) 
     static std::atomic<bool> exhausted;
     failures = 0;
     exhausted = true;
-    const Injected failing(oxSocket::m_lpfnaccept, +[](int descriptor, sockaddr* address, socklen_t* length) {
-        if (!exhausted)
-            return accept4(descriptor, address, length, SOCK_CLOEXEC);
-        ++failures;
-        errno = EMFILE;
-        return -1;
-    });
+    const Injected failing(
+        oxSocket::m_lpfnaccept, +[](int descriptor, sockaddr* address, socklen_t* length) {
+            if (!exhausted)
+                return accept4(descriptor, address, length, SOCK_CLOEXEC);
+            ++failures;
+            errno = EMFILE;
+            return -1;
+        });
     ASSERT_TRUE(Start());
     Client waiting(settings.port);
     waiting.Send("GET / HTTP/1.0\r\n\r\n");
@@ -154,13 +162,14 @@ TEST_F(oxHttpDaemonTest, FailingAcceptsAreReportedOnceASecondAndServiceReturns) 
 TEST_F(oxHttpDaemonTest, ClientThatLeavesBeforeItIsAcceptedLeavesNoLine) {
     static std::atomic<int> aborted;
     aborted = 0;
-    const Injected failing(oxSocket::m_lpfnaccept, +[](int descriptor, sockaddr* address, socklen_t* length) {
-        if (aborted++ % 2 == 0) {
-            errno = ECONNABORTED;
-            return -1;
-        }
-        return accept4(descriptor, address, length, SOCK_CLOEXEC);
-    });
+    const Injected failing(
+        oxSocket::m_lpfnaccept, +[](int descriptor, sockaddr* address, socklen_t* length) {
+            if (aborted++ % 2 == 0) {
+                errno = ECONNABORTED;
+                return -1;
+            }
+            return accept4(descriptor, address, length, SOCK_CLOEXEC);
+        });
     ASSERT_TRUE(Start());
     Poke();
     Poke();
@@ -173,7 +182,7 @@ TEST_F(oxHttpDaemonTest, AcceptedConnectionsAreCloseOnExec) {
     std::atomic<int> unguarded{0};
     server->onRequest = [&](const oxRequest&) {
         for (int descriptor = 3; descriptor < 200; ++descriptor) {
-            struct sockaddr_in peer{};
+            struct sockaddr_in peer {};
             socklen_t length = sizeof peer;
             if (getpeername(descriptor, reinterpret_cast<sockaddr*>(&peer), &length) == 0 &&
                 ntohs(peer.sin_port) != settings.port)
@@ -183,6 +192,165 @@ TEST_F(oxHttpDaemonTest, AcceptedConnectionsAreCloseOnExec) {
     };
     EXPECT_NE(Ask(settings.port, "GET / HTTP/1.0\r\n\r\n").find("404"), std::string::npos);
     EXPECT_EQ(unguarded, 0);
+}
+
+TEST_F(oxHttpDaemonTest, StopRightAfterTheStartLeavesNoErrorLine) {
+    server->Configure(settings);
+    for (int i = 0; i < 300; ++i) {
+        ASSERT_TRUE(server->Start());
+        server->Stop();
+    }
+    EXPECT_EQ(Count("failed"), 0);
+    EXPECT_EQ(Count("rror"), 0);
+}
+
+TEST_F(oxHttpDaemonTest, StartRightAfterAnErrorEndSucceeds) {
+    static std::atomic<bool> broken;
+    const Injected failing(
+        oxSocket::m_lpfnlisten, +[](int descriptor, int backlog) {
+            if (!broken)
+                return listen(descriptor, backlog);
+            errno = EADDRINUSE;
+            return -1;
+        });
+    for (int i = 0; i < 100; ++i) {
+        broken = true;
+        ASSERT_TRUE(Start());
+        ASSERT_TRUE(Eventually([&] { return server->GetState() == oxHttpServer::STATE_ERROR; }));
+        broken = false;
+        server->Stop();
+        ASSERT_TRUE(server->Start()) << i;
+        EXPECT_EQ(server->GetState(), oxHttpServer::STATE_RUNNING);
+        Poke();
+        server->Stop();
+    }
+    EXPECT_EQ(Count("Unable to create daemon thread"), 0);
+}
+
+TEST_F(oxHttpDaemonTest, FullDescriptorTableWithNobodyWaitingIsNoError) {
+    static std::atomic<int> calls;
+    calls = 0;
+    const Injected failing(
+        oxSocket::m_lpfnaccept, +[](int, sockaddr*, socklen_t*) {
+            ++calls;
+            errno = EMFILE;
+            return -1;
+        });
+    ASSERT_TRUE(Start());
+    ASSERT_TRUE(Eventually([] { return calls >= 3; }));
+    server->Stop();
+    EXPECT_EQ(calls, 3);
+    EXPECT_EQ(Count("Accept error"), 0);
+}
+
+TEST_F(oxHttpDaemonTest, AlternatingFailuresAreReportedOnceASecond) {
+    static std::atomic<int> calls;
+    calls = 0;
+    const Injected failing(
+        oxSocket::m_lpfnaccept, +[](int descriptor, sockaddr* address, socklen_t* length) {
+            if (++calls % 4 == 0)  // a round of three tries fails, then one connection is accepted
+                return accept4(descriptor, address, length, SOCK_CLOEXEC);
+            errno = ENFILE;
+            return -1;
+        });
+    ASSERT_TRUE(Start());
+    const auto begin = std::chrono::steady_clock::now();
+    for (int i = 0; i < 8; ++i)
+        Poke();
+    const auto seconds = std::chrono::ceil<std::chrono::seconds>(std::chrono::steady_clock::now() - begin).count();
+    server->Stop();
+    EXPECT_GE(Count("Socket::Accept error: Too many open files in system (23)."), 1);
+    EXPECT_LE(Count("Socket::Accept error"), seconds + 1);
+}
+
+TEST_F(oxHttpDaemonTest, StopDuringTheAcceptPauseIsPromptAndSilent) {
+    static std::atomic<int> calls;
+    calls = 0;
+    const Injected failing(
+        oxSocket::m_lpfnaccept, +[](int, sockaddr*, socklen_t*) {
+            ++calls;
+            errno = ENOMEM;
+            return -1;
+        });
+    ASSERT_TRUE(Start());
+    const Client waiting(settings.port);
+    ASSERT_TRUE(Eventually([] { return calls >= 12; }));  // the pause is near its longest
+    const int lines = Count("Accept error");
+    server->Stop();
+    EXPECT_EQ(Count("Daemon thread exiting normally."), 1);
+    EXPECT_LE(Count("Accept error"), lines + 1);
+    EXPECT_EQ(Count("Success"), 0);
+}
+
+TEST_F(oxHttpDaemonTest, ListenerThreadThatCannotBeStartedFailsTheStart) {
+    FailingThreads failing(EAGAIN);
+    EXPECT_FALSE(Start());
+    EXPECT_EQ(server->GetDaemonState(), -2);
+    EXPECT_EQ(Count("Unable to create daemon thread, thread error = 11"), 1);
+    EXPECT_EQ(Count("Server unable to start. (error=11)"), 1);
+    failing.End();
+    EXPECT_TRUE(server->Start());
+}
+
+TEST_F(oxHttpDaemonTest, SessionThreadThatCannotBeStartedClosesTheConnectionAndTheLoopGoesOn) {
+    ASSERT_TRUE(Start());
+    {
+        const FailingThreads failing(EAGAIN);
+        std::list<Client> clients;  // threads that earlier sessions left behind serve the first few
+        ASSERT_TRUE(Eventually([&] {
+            clients.emplace_back(settings.port);
+            return Count("Unable to create session thread") > 0;
+        }));
+        EXPECT_EQ(clients.back().ReadAll(), "");
+    }
+    EXPECT_EQ(Count("Unable to create session thread, thread error = 11"), 1);
+    EXPECT_NE(Ask(settings.port, "GET / HTTP/1.0\r\n\r\n").find("home"), std::string::npos);
+}
+
+TEST_F(oxHttpDaemonTest, RootIsGivenBackExceptWhereTheSocketCannotBeCreated) {
+    if (getuid() != 0)
+        GTEST_SKIP() << "needs root";
+#ifdef SYS_setresuid32
+    constexpr long SET_IDS = SYS_setresuid32;
+#else
+    constexpr long SET_IDS = SYS_setresuid;
+#endif
+    server->Configure(settings);
+    struct Case {
+        bool create;
+        uid_t after;
+    };
+    for (const Case& c : {Case{true, 0}, {false, 1}}) {
+        uid_t during = 99;
+        uid_t after = 99;
+        static uid_t seen;
+        std::thread([&] {  // the ids of one thread; they end with it
+            ASSERT_EQ(syscall(SET_IDS, -1, 1, -1), 0);
+            if (c.create) {
+                const Injected failing(
+                    oxSocket::m_lpfnsocket, +[](int, int, int) {
+                        seen = geteuid();
+                        errno = EMFILE;
+                        return -1;
+                    });
+                EXPECT_FALSE(server->StartDaemon("127.0.0.1"));
+            } else {
+                const Injected failing(
+                    oxSocket::m_lpfnbind, +[](int, const sockaddr*, socklen_t) {
+                        seen = geteuid();
+                        errno = EACCES;
+                        return -1;
+                    });
+                EXPECT_FALSE(server->StartDaemon("127.0.0.1"));
+            }
+            during = seen;
+            after = geteuid();
+        })
+            .join();
+        EXPECT_EQ(during, 0u);
+        EXPECT_EQ(after, c.after);
+    }
+    EXPECT_EQ(geteuid(), 0u);
 }
 
 }  // namespace

@@ -96,8 +96,13 @@ TEST(AccessLogLine, ZoneIsWrittenInUnsignedArithmetic) {
         std::int32_t zone;
         const char* text;
     };
-    for (const Case& c : {Case{0, "-0000"}, {18000, "-0500"}, {12600, "-031800"}, {-3600, "+11930451696"},
-                          {-19800, "+11930403496"}, {1, "-0001"}, {39600, "-1100"}}) {
+    for (const Case& c : {Case{0, "-0000"},
+                          {18000, "-0500"},
+                          {12600, "-031800"},
+                          {-3600, "+11930451696"},
+                          {-19800, "+11930403496"},
+                          {1, "-0001"},
+                          {39600, "-1100"}}) {
         oxRequest request;
         const std::string line = oxHttpServerLog::FormatLine(oxSockAddr(1U), request, nullptr, NOW, c.zone);
         EXPECT_NE(line.find(std::string(" ") + c.text + "] \""), std::string::npos) << line;
@@ -110,8 +115,10 @@ TEST(AccessLogLine, TimeIsLocalAndDayAndHourAreNotPadded) {
         std::time_t when;
         const char* stamp;
     };
-    for (const Case& c : {Case{"UTC0", 0, "[1/Jan/1970:0:00:00 "}, {"EST5", 0, "[31/Dec/1969:19:00:00 "},
-                          {"XXX-1", NOW, "[6/Nov/1994:9:49:37 "}, {"UTC0", 951782400, "[29/Feb/2000:0:00:00 "}}) {
+    for (const Case& c : {Case{"UTC0", 0, "[1/Jan/1970:0:00:00 "},
+                          {"EST5", 0, "[31/Dec/1969:19:00:00 "},
+                          {"XXX-1", NOW, "[6/Nov/1994:9:49:37 "},
+                          {"UTC0", 951782400, "[29/Feb/2000:0:00:00 "}}) {
         const Zone zone(c.zone);
         oxRequest request;
         const std::string line = oxHttpServerLog::FormatLine(oxSockAddr(1U), request, nullptr, c.when, 0);

@@ -25,11 +25,24 @@ public:
     std::unique_ptr<oxHttpSession> MakeSession() override {
         if (onMakeSession)
             onMakeSession();
-        return oxHttpDaemon::MakeSession();
+        auto session = oxHttpDaemon::MakeSession();
+        const std::scoped_lock lock(m_made);
+        m_sessions.push_back(session.get());
+        return session;
+    }
+
+    // Whether the session that was made as the n-th (from 0) has finished. Only while the server still lists it.
+    bool IsFinished(std::size_t n) {
+        const std::scoped_lock lock(m_made);
+        return n < m_sessions.size() && m_sessions[n]->GetState() == oxHttpSession::STATE_FINISHED;
     }
 
     std::function<std::unique_ptr<oxResource>(const oxRequest&)> onRequest;
     std::function<void()> onMakeSession;
+
+private:
+    MMutex m_made;
+    std::vector<const oxHttpSession*> m_sessions;
 };
 
 class ServerFixture : public testing::Test {
@@ -70,6 +83,23 @@ protected:
     }
     // Makes the listener sweep, as every new connection does.
     void Poke() const { Ask(settings.port, "GET / HTTP/1.0\r\n\r\n"); }
+    // A session ends a moment after its client has seen the end: pokes until the given sessions are removed.
+    bool PokeUntilRemoved(int sessions) const {
+        return Eventually([&] {
+            Poke();
+            return Count("Removing user session") >= sessions;
+        });
+    }
+    // Moves the clock on until a session that is not served in that time is dropped.
+    bool AdvanceUntilTimedOut() {
+        return Eventually([&] {
+            clock.Advance(settings.sessionTimeout + 1);
+            return WaitForMessageFor("has timed-out -- removing.", std::chrono::seconds(3));
+        });
+    }
+    bool WaitForMessageFor(const std::string& text, std::chrono::milliseconds limit) const {
+        return Eventually([&] { return Count(text) > 0; }, limit);
+    }
 
     Scratch dir;
     ManualClock clock;

@@ -4,6 +4,7 @@
 #include <arpa/inet.h>
 #include <netinet/in.h>
 #include <sys/socket.h>
+#include <sys/time.h>
 #include <unistd.h>
 
 #include <cstdint>
@@ -32,6 +33,8 @@ public:
         m_socket = UniqueFd(socket(AF_INET, SOCK_STREAM | SOCK_CLOEXEC, 0));
         if (receiveBuffer != 0)
             setsockopt(m_socket.Get(), SOL_SOCKET, SO_RCVBUF, &receiveBuffer, sizeof receiveBuffer);
+        const timeval patience{.tv_sec = 60, .tv_usec = 0};  // no test hangs on an answer that never comes
+        setsockopt(m_socket.Get(), SOL_SOCKET, SO_RCVTIMEO, &patience, sizeof patience);
         sockaddr_in to{};
         to.sin_family = AF_INET;
         to.sin_port = htons(static_cast<std::uint16_t>(port));

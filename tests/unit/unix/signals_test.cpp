@@ -101,17 +101,29 @@ TEST(OxSignals, OnlyTheSystemsNoticeOfAChildIsDropped) {
         siginfo_t info{};
         info.si_signo = row.number;
         info.si_code = row.code;
-        EXPECT_EQ(oxSignals::IsChildNotice(info), row.dropped) << row.number << " " << row.code;
+        EXPECT_EQ(oxSignals::IsOwnNotice(info), row.dropped) << row.number << " " << row.code;
+    }
+}
+
+TEST(OxSignals, WriteFailuresOfTheProcessItselfAreNoCommands) {
+    for (const int number : {SIGPIPE, SIGXFSZ, SIGTERM}) {
+        siginfo_t info{};
+        info.si_signo = number;
+        info.si_code = SI_USER;
+        info.si_pid = getpid();
+        EXPECT_EQ(oxSignals::IsOwnNotice(info), number != SIGTERM) << number;
+        info.si_pid = getpid() + 1;
+        EXPECT_FALSE(oxSignals::IsOwnNotice(info)) << number;
     }
 }
 
 TEST(OxSignals, TheEndOfAChildPassesAndASentSeventeenDoesNot) {
     TestSignals signals;
-    signals.endsOn = SIGXFSZ;      // above 17, so that it is taken after it
+    signals.endsOn = SIGVTALRM;      // above 17, so that it is taken after it
     RunInChild([] { return 0; });  // its notice is pending now
-    kill(getpid(), SIGXFSZ);
+    kill(getpid(), SIGVTALRM);
     signals.Run();
-    EXPECT_EQ(signals.taken, std::vector<int>{SIGXFSZ});
+    EXPECT_EQ(signals.taken, std::vector<int>{SIGVTALRM});
 
     signals.taken.clear();
     signals.endsOn = SIGCHLD;

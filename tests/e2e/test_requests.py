@@ -237,6 +237,26 @@ def test_an_unannounced_body_is_dropped_and_the_answer_arrives_whole(site, serve
         server.signal(signal.SIGCONT)
 
 
+@pytest.mark.parametrize("head", [b"POST /hello.htm HTTP/1.0\r\ncontent-length: 8\r\n\r\n",
+                                  b"POST /hello.htm HTTP/1.1\r\nTransfer-Encoding: chunked\r\n\r\n"])
+def test_a_body_that_is_not_announced_and_comes_late_costs_nobody_the_answer(site, server, head):
+    """The answer is under way when the body arrives; closing the connection at that moment would reset it."""
+    content = (site.web / "hello.htm").read_bytes()
+    for _ in range(10):
+        with Client(site.port) as client:
+            client.send(head)
+            first = client.socket.recv(1)
+            client.send(b"3\r\na=b\r\n")
+            assert (first + client.read_all()).endswith(b"\r\n\r\n" + content)
+
+
+@pytest.mark.parametrize("request_line", [b"GET /hello.htm\0zz HTTP/1.0", b"GET /hello.htm HTTP/1\0.0"])
+def test_a_nul_in_the_request_line_is_a_bad_request(site, server, request_line):
+    with Client(site.port) as client:
+        client.send(request_line + b"\r\n\r\n")
+        assert client.read_all().startswith(b"HTTP/1.0 400 Bad Request\r\n")
+
+
 def test_more_body_than_announced_beyond_the_buffer_gets_400(site, server):
     """20,000 bytes of header and an announced body of 14,000 grow the buffer to 46,766 bytes; all of the 50,000 bytes
     are waiting when the server reads, so the buffer fills up before the body's end is looked at."""

@@ -6,8 +6,9 @@
 #include <cstddef>
 #include <string>
 
-// Goes through the socket's function table. The C library keeps each result in a place of the whole process, so
-// look-ups run one at a time and give out copies. They may block for as long as the name service does.
+// Goes through the socket's function table: by the re-entrant forms of the C library's own functions, so that a slow
+// name service holds up nobody else, and one at a time where the table holds another function. They may block for as
+// long as the name service does.
 class oxResolver {
 public:
     // The address bytes and the family of the host's first address; both are left alone when it is not found.

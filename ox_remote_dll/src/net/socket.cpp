@@ -229,12 +229,18 @@ bool oxSocket::Close() {
     const int handle = use.Handle();
     if (handle == -1)
         return true;
-    if (use.IsShared())
+    const bool shared = use.IsShared();
+    if (shared) {
+        // A connect that is about to begin would not notice that the socket was shut down before it.
+        const timeval soon{.tv_sec = 0, .tv_usec = 1};
+        m_lpfnsetsockopt(handle, SOL_SOCKET, SO_SNDTIMEO, &soon, sizeof soon);
         m_lpfnshutdown(handle, SHUT_RDWR);
+    }
     if (!use.Leave())
         return true;
     // An interrupted close has closed; the number may belong to another file already.
-    return Result(m_lpfnclose(handle));
+    const int result = m_lpfnclose(handle);
+    return shared || Result(result);  // the error code is the other user's
 }
 
 bool oxSocket::Shutdown(int how) {
@@ -276,7 +282,7 @@ bool oxSocket::Connect(const sockaddr* address, socklen_t length) {
     int result = m_lpfnconnect(use.Handle(), address, length);
     if (result == -1 && errno == EINTR)
         result = FinishConnect(use.Handle());
-    if (result == 0 && GetHandle() != use.Handle()) {  // closed by another thread meanwhile
+    if (GetHandle() != use.Handle()) {  // closed by another thread meanwhile
         errno = ECONNABORTED;
         result = -1;
     }

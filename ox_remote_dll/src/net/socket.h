@@ -53,8 +53,7 @@ public:
     virtual bool Bind(const char* host, std::uint16_t port);
     virtual bool Bind(std::uint32_t address, const char* service, const char* protocol);
     virtual bool Bind(const char* host, const char* service, const char* protocol);
-    // Fails with ECONNABORTED when another thread closed the socket meanwhile; a close in the very moment before the
-    // system begins to connect shows only when the attempt ends.
+    // Fails with ECONNABORTED when another thread closed the socket meanwhile.
     virtual bool Connect(const sockaddr* address, socklen_t length);
     virtual bool Listen(int backlog);
     // On success the other object has the new handle and this socket's family, type and protocol; on failure it is

@@ -42,8 +42,11 @@ public:
     bool Read(oxSocket& socket, oxErrorSink& log);
     // Takes the buffer apart. False, with a status, when the request is bad.
     bool Parse();
-    // True when everything that belongs to the request has been read from the socket.
-    bool IsComplete() const { return m_complete; }
+    // True when everything that belongs to the request has been read from the socket, as far as the request tells: the
+    // body of a POST that announced none in the way that is looked for may still be on its way.
+    bool IsComplete() const {
+        return m_complete && (m_method != METHOD_POST || m_body != NOWHERE || m_announcedLength == 0);
+    }
 
     Method GetMethod() const { return m_method; }
     const char* GetMethodName() const;  // empty when unknown

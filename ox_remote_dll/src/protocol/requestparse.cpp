@@ -114,7 +114,7 @@ bool oxRequest::ParseRequestLine(std::string_view text, std::string_view& header
         text.remove_prefix(1);
     TakeVersion(TakeToken(text, TOKEN_END));
     if (text.empty())
-        return true;
+        return Text().size() == m_count;  // a NUL in the line is no end of input
     text = SkipSpaces(text);
     if (!text.starts_with(LINE_END))
         return false;

@@ -219,6 +219,47 @@ TEST_F(OxSocketThreads, NewSocketInTheSameObjectIsNotTouchedByTheOldOnesUsers) {
     EXPECT_NE(-1, ::fcntl(fresh, F_GETFD));
 }
 
+// A listener that answers no more: its queue is full, so that a further connect waits for the system's whole time.
+class FullListener {
+public:
+    FullListener() {
+        ListenOnLoopback(m_listener, 0);
+        m_address = m_listener.GetLocalAddress();
+        for (oxSocket& client : m_clients) {
+            EXPECT_TRUE(client.Create(AF_INET, SOCK_STREAM, 0));
+            client.SetNonBlocking(true);
+            client.Connect(m_address.Raw(), oxSockAddr::LENGTH);
+        }
+    }
+    const oxSockAddr& Address() const { return m_address; }
+
+private:
+    oxSocket m_listener;
+    oxSocket m_clients[4];
+    oxSockAddr m_address;
+};
+
+TEST_F(OxSocketThreads, CloseByAnotherThreadEndsAConnectThatGetsNoAnswer) {
+    const FullListener full;
+    for (const bool begun : {true, false}) {
+        SCOPED_TRACE(begun);
+        oxSocket socket;
+        ASSERT_TRUE(socket.Create(AF_INET, SOCK_STREAM, 0));
+        s_gate.Reset();
+        oxSocket::m_lpfnconnect = GatedConnect;
+        std::thread owner([&] {
+            EXPECT_FALSE(socket.Connect(full.Address().Raw(), oxSockAddr::LENGTH));
+            EXPECT_EQ(ECONNABORTED, socket.ErrorCode());
+        });
+        s_gate.AwaitInside(1);
+        if (begun)
+            s_gate.Open();  // the close comes before, during or after the system call
+        EXPECT_TRUE(socket.Close());
+        s_gate.Open();
+        owner.join();
+    }
+}
+
 TEST_F(OxSocketThreads, ConnectOfASocketClosedMeanwhileFails) {
     oxSocket listener, socket;
     const oxSockAddr address = ListenOnLoopback(listener);

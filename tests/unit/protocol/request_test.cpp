@@ -244,8 +244,9 @@ std::vector<Case> Cases() {
         {"EndBehindColon", HEAD + "User-Agent:", GetUrl("/x")},
         // A NUL ends the text.
         {"NulInMethod", "G\0ET /x HTTP/1.0\r\n\r\n"s, Bad(1)},
-        {"NulInUrl", "GET /x\0y HTTP/1.0\r\n\r\n"s, Version("", 0, 0)},
-        {"NulInVersion", "GET /x HTTP/1\0.0\r\n\r\n"s, Version("", 0, 0)},
+        {"NulInUrl", "GET /x\0y HTTP/1.0\r\n\r\n"s, Bad(1, "/x", "/x")},
+        {"NulInVersion", "GET /x HTTP/1\0.0\r\n\r\n"s, Bad(1, "/x", "/x")},
+        {"NulBehindVersion", "GET /x HTTP/1.0\0\r\n\r\n"s, BadLine()},
         {"NulBeforeHeader", HEAD + "X: \0\r\nUser-Agent: a\r\n\r\n"s, GetUrl("/x")},
         {"NulInHeader", HEAD + "User-Agent: a\0b\r\n\r\n"s, With(GetUrl("/x"), &Outcome::agent, "a")},
         {"NulBeforeLength", "POST /x HTTP/1.0\r\nX: \0\r\nContent-Length: 3\r\n\r\nabc"s, Post("/x", "", "")},

@@ -21,6 +21,9 @@
 #include "platform/file.h"
 #include "support/errorsink.h"
 
+// The first socket of a process looks up the machine's name; one that stays spares every test that.
+inline const oxSocket FIRST_SOCKET;
+
 class LineLog : public oxErrorSink {
 public:
     void Error(const char* format, ...) override __attribute__((format(printf, 2, 3))) {

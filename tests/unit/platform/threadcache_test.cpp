@@ -1,13 +1,14 @@
 #include "platform/threadcache.h"
 
 #include <gtest/gtest.h>
-#include <pthread.h>
+#include <unistd.h>
 
 #include <atomic>
 #include <cerrno>
 #include <latch>
 #include <set>
 #include <thread>
+#include <vector>
 
 #include "platform/thread.h"
 #include "testing/waiting.h"
@@ -24,8 +25,9 @@ int StartCounted(void* (*entry)(void*), void* argument) {
 
 // Never destroyed, as its users do it: threads may still wait in it.
 MThreadCache& NewCache() {
+    static std::vector<MThreadCache*> caches;
     started = 0;
-    return *new MThreadCache(&StartCounted);
+    return *caches.emplace_back(new MThreadCache(&StartCounted));
 }
 
 // Does the work and waits until its thread is kept again.

@@ -39,6 +39,46 @@ TEST(FillStandardDescriptors, OpensOnlyWhatIsClosed) {
               0);
 }
 
+TEST(DropInheritedDescriptors, ClosesAllAboveStandardError) {
+    EXPECT_EQ(RunInChild([] {
+                  const int zero = open("/dev/zero", O_RDWR);
+                  for (int i = 0; i < 3; ++i)
+                      dup2(zero, i);
+                  const int far = fcntl(zero, F_DUPFD, 500);
+                  const int own = fcntl(zero, F_DUPFD_CLOEXEC, 600);
+                  if (zero < 3 || far < 500 || own < 600)
+                      return 1;
+                  DropInheritedDescriptors(true);
+                  for (const int gone : {zero, far, own})
+                      if (fcntl(gone, F_GETFD) != -1 || errno != EBADF)
+                          return 2;
+                  for (int i = 0; i < 3; ++i)
+                      if (fcntl(i, F_GETFD) != 0)
+                          return 3;
+                  return 0;
+              }),
+              0);
+}
+
+TEST(DropInheritedDescriptors, OrOnlyKeepsThemFromStartedPrograms) {
+    EXPECT_EQ(RunInChild([] {
+                  const int zero = open("/dev/zero", O_RDWR);
+                  for (int i = 0; i < 3; ++i)
+                      dup2(zero, i);
+                  const int far = fcntl(zero, F_DUPFD, 500);
+                  if (zero < 3 || far < 500 || fcntl(zero, F_GETFD) != 0 || fcntl(far, F_GETFD) != 0)
+                      return 1;
+                  DropInheritedDescriptors(false);
+                  if (fcntl(zero, F_GETFD) != FD_CLOEXEC || fcntl(far, F_GETFD) != FD_CLOEXEC)
+                      return 2;
+                  for (int i = 0; i < 3; ++i)
+                      if (fcntl(i, F_GETFD) != 0)
+                          return 3;
+                  return 0;
+              }),
+              0);
+}
+
 TEST(SilenceStandardStreams, PointsInputAndOutputAtNothing) {
     EXPECT_EQ(RunInChild([] {
                   const int zero = open("/dev/zero", O_RDWR);

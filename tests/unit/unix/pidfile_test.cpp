@@ -177,3 +177,24 @@ TEST_F(OxPidFile, TheFileOfAnotherServerIsNotRemoved) {
     pidFile.Remove();
     EXPECT_EQ(ReadText(path), "2\n");
 }
+
+TEST_F(OxPidFile, CannotBeDeleted) {
+    EXPECT_EQ(RunInChild([this] {
+                  if (!pidFile.Write(TITLE, 1))
+                      return 1;
+                  if (chmod(scratch.Path().c_str(), 0555) != 0)
+                      return 2;
+                  // Root may delete everywhere, so an ordinary user plays its part.
+                  constexpr uid_t ORDINARY_USER = 65534;
+                  if (geteuid() == 0 && setresuid(ORDINARY_USER, ORDINARY_USER, ORDINARY_USER) != 0)
+                      return 3;
+                  pidFile.Remove();
+                  const Lines wanted{"Error: can't delete " + path + ": Permission denied"};
+                  return audit.lines == wanted ? 0 : 4;
+              }),
+              0);
+    EXPECT_EQ(chmod(scratch.Path().c_str(), 0700), 0);
+    EXPECT_EQ(ReadText(path), "1\n");
+    EXPECT_EQ(RunInChild([this] { return oxPidFile(path, audit).Write(TITLE, 2) ? 0 : 1; }), 0)
+        << "the lock was given up";
+}

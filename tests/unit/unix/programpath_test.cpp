@@ -30,3 +30,19 @@ TEST(ProgramPath, DirectoryIsMadeAbsoluteAndFilesLieBeside) {
         EXPECT_EQ(BesideProgram(program, "pid"), row.pidFile);
     }
 }
+
+TEST(ProgramPath, BackslashAndBlanksInTheWorkingDirectoryAreKept) {
+    const ScratchDirectory scratch;
+    for (const char* name : {"a\\b", " two  blanks ", "\\ \\", "dir.with\\dot . s"}) {
+        SCOPED_TRACE(name);
+        const std::string here = scratch.File(name);
+        ASSERT_TRUE(std::filesystem::create_directory(here));
+        std::filesystem::current_path(here);
+        for (const char* called : {"ox_remote", "./ox_remote"}) {
+            const oxFilename program = ProgramPath(called);
+            EXPECT_EQ(program.Directory(), here) << called;
+            EXPECT_EQ(BesideProgram(program, "pid"), here + "/ox_remote.pid") << called;
+        }
+        EXPECT_EQ(ProgramPath("bin/ox_remote").Directory(), here + "/bin");
+    }
+}

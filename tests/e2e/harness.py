@@ -58,6 +58,12 @@ DEAD_PID = 99999999  # above every pid_max, and longer than every real pid
 NOBODY = 65534
 
 
+def shown_host_name(name=None):
+    """The machine's name as the server's start line shows it: one of 64 characters or more does not fit."""
+    name = socket.gethostname() if name is None else name
+    return name if len(os.fsencode(name)) < 64 else "local"
+
+
 def not_running(errno):
     return f"Error: The server is not running ({errno}).\n\n"
 
@@ -374,6 +380,12 @@ class Installation:
     @property
     def access_log(self):
         return self.root / self.settings["RemoteConfiguration"].get("WebLogFileName", "ox_remote.log")
+
+    def rename(self, name):
+        """Gives the directory of the installation another name, before anything runs in it."""
+        self.root = self.root.rename(self.scratch / name)
+        self.exe, self.web, self.ini = self.root / "ox_remote", self.root / "wwwroot", self.root / "ox_remote.ini"
+        self.main_ini = self.root / "oxm_oxx" / "oxm_oxx.ini"
 
     def _log_files(self, which):
         if which == "startup":
@@ -822,6 +834,26 @@ class Background:
             assert not thread.is_alive(), "a client thread did not end"
         if self.errors:
             raise self.errors[0]
+
+
+def spoil_settings(path, kind):
+    """Replaces a settings file by something that does not load; what the system says to it is returned."""
+    text = path.read_bytes()
+    path.unlink()
+    if kind == "directory":
+        path.mkdir()
+        return "Is a directory"
+    if kind == "nul":
+        path.write_bytes(text + b"[x]\ny=\0z\n")
+        return "The file holds a NUL byte"
+    if kind == "pipe":
+        os.mkfifo(path, 0o644)
+    elif kind == "device":
+        path.symlink_to("/dev/zero")
+    else:
+        assert kind == "missing"
+        return "No such file or directory"
+    return "Invalid argument"
 
 
 def mode_of(path):

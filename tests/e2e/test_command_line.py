@@ -1,9 +1,12 @@
 """The command line: every form with its exit status and its exact output."""
 
+import ctypes
 import os
 import re
 import signal
+import socket
 import subprocess
+import sys
 import time
 
 import pytest
@@ -20,6 +23,7 @@ from harness import (
     USAGE,
     not_running,
     process_status,
+    shown_host_name,
     wait_until,
 )
 
@@ -254,6 +258,46 @@ def test_an_ordinary_user_cannot_go_beyond_the_hard_limit(site):
         f"{warning}\nRLIMIT_NOFILE set to 200.\n" + BANNER + not_running(2),
     )
     site.expect("startup", re.escape(warning), times=1)
+
+
+NAMELESS_USAGE = USAGE.replace("ox_remote", "")
+
+
+def test_an_empty_program_name_counts_as_one_in_the_working_directory(site):
+    assert site.run("-status", argv0="") == (1, BANNER + not_running(2))
+    assert site.run(argv0="") == (1, BANNER + NAMELESS_USAGE)
+    assert (site.root / ".startup").exists()
+
+
+def test_without_even_a_program_name_the_usage_is_printed(site):
+    """Newer kernels hand an empty program name to a program that is started without arguments."""
+    start = "import ctypes, sys; ctypes.CDLL(None).execv(sys.argv[1].encode(), (ctypes.c_char_p * 1)()); sys.exit(99)"
+    code, out = site.run("-c", start, str(site.exe), program=sys.executable, timeout=5 * SLOWDOWN)
+    assert code == 1
+    kernel = tuple(int(number) for number in re.match(r"(\d+)\.(\d+)", os.uname().release).groups())
+    assert out == (BANNER if kernel >= (5, 18) else "") + NAMELESS_USAGE
+    assert site.leftover_processes() == []
+    assert not list(site.root.glob("*.pid"))
+
+
+@needs_root
+@pytest.mark.parametrize("name,shown", [("h" * 63, "h" * 63), ("h" * 64, "local")], ids=["63", "64"])
+def test_a_host_name_that_does_not_fit_is_shown_as_local(site, name, shown):
+    libc = ctypes.CDLL(None, use_errno=True)
+    new_names = 0x04000000  # CLONE_NEWUTS: the name is changed for the server alone
+    if subprocess.run(["unshare", "--uts", "true"], stderr=subprocess.DEVNULL).returncode != 0:
+        pytest.skip("namespaces are not allowed here")
+
+    def rename_machine():
+        if libc.unshare(new_names) != 0:
+            raise OSError(ctypes.get_errno(), "unshare")
+        socket.sethostname(name)
+
+    server = site.serve(preexec_fn=rename_machine)
+    assert shown_host_name(name) == shown
+    assert f"Remote interface server available on http://{shown}:{site.port}." in site.status()
+    assert site.get("/hello.htm").status == 200
+    server.stop()
 
 
 @needs_root

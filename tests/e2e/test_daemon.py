@@ -1,7 +1,10 @@
 """The server in the background. Each start takes the five seconds of the parent's pause, so each test looks at much."""
 
+import errno
+import fcntl
 import os
 import re
+import select
 import signal
 import socket
 import subprocess
@@ -13,8 +16,10 @@ from harness import (
     ALREADY_RUNNING,
     BANNER,
     DEAD_PID,
+    INVALID,
     SLOWDOWN,
     STATUS_NOTICE,
+    USAGE,
     Daemon,
     descriptors,
     free_port,
@@ -23,6 +28,7 @@ from harness import (
     not_running,
     port_in_use_line,
     process_status,
+    shown_host_name,
     wait_until,
 )
 
@@ -30,9 +36,8 @@ pytestmark = pytest.mark.daemon
 
 
 def start_lines(site, pid):
-    host = socket.gethostname()[:63] or "local"
     return (
-        f"Remote interface server available on http://{host}:{site.port}.\n"
+        f"Remote interface server available on http://{shown_host_name()}:{site.port}.\n"
         f"The remote configuration server has been started ({pid}).\n"
     )
 
@@ -87,6 +92,90 @@ def test_start_then_status_and_stop_then_start(site):
     code, out = site.run("-stop")
     assert code == 0 and out.endswith("The server has been stopped.\n")
     assert sum("oxSIGSTATUS" in line for line in site.status()) == 1
+
+
+def test_start_then_an_unknown_switch(site):
+    """The server runs all the same; the exit status is that of the last switch."""
+    code, out, daemon = site.start_daemon("-start", "-bogus")
+    assert (code, out) == (1, BANNER + start_lines(site, daemon.pid) + INVALID + USAGE)
+    assert site.get("/hello.htm").status == 200
+    assert daemon.alive()
+
+
+def test_stop_start_and_stop_in_one_call(site, server):
+    tail = "The server has been stopped.\n"
+    code, out = site.run("-stop", "-start", "-stop")
+    assert server.wait_exit() == 0
+    assert code == 0
+    assert out.startswith(BANNER) and out.endswith(tail) and out.count(tail) == 2
+    pids = re.findall(r"has been started \((\d+)\)\.", out)
+    assert len(pids) == 1 and int(pids[0]) != server.pid
+    assert start_lines(site, pids[0]) in out
+    assert not site.pid_file.exists() and not is_listening(site.port)
+    assert site.leftover_processes() == []
+    assert site.status()[-1] == f"Process {pids[0]} termination requested. Cleaning up..."
+
+
+def test_stop_start_and_stop_where_nothing_runs(site):
+    """A failed switch does not keep the next ones from being carried out."""
+    code, out = site.run("-stop", "-start", "-stop")
+    pid = re.search(r"has been started \((\d+)\)\.", out)[1]
+    assert code == 0
+    assert out.startswith(BANNER + not_running(2) + start_lines(site, pid))
+    assert out.endswith("The server has been stopped.\n")
+    assert site.leftover_processes() == []
+    assert not site.pid_file.exists()
+
+
+@pytest.mark.parametrize("count", [2, 4])
+def test_of_several_starts_at_once_exactly_one_serves(site, count):
+    commands = [site.spawn("-start", stdout=subprocess.PIPE, stderr=subprocess.PIPE) for _ in range(count)]
+    results = []
+    for command in commands:
+        out, err = command.communicate(timeout=60 * SLOWDOWN)
+        results.append((command.returncode, out.decode("latin-1"), err.decode("latin-1")))
+    daemon = Daemon(site, site.read_pid())
+    site.servers.append(daemon)
+    assert site.leftover_processes() == [daemon.pid]
+    assert [path.name for path in site.root.glob("*.pid")] == ["ox_remote.pid"]
+    assert site.pid_file.read_text() == f"{daemon.pid}\n"
+    assert site.get("/hello.htm").status == 200
+    assert sum("has been started" in line for line in site.status()) == 1
+    assert len(site.err()) == 1, "only one has begun to serve"
+
+    lost = [
+        f"Error: Orvex Reporting UI is already running: {os.strerror(errno.EAGAIN)}",
+        f"Error: Unable to create lock file, {site.pid_file}.",
+    ]
+    locked_out = (0, BANNER + "".join(f"{line}\n" for line in lost), "")
+    refused = (1, BANNER + ALREADY_RUNNING, "")
+    served = (0, BANNER + start_lines(site, daemon.pid), "")
+    assert results.count(served) == 1, results
+    assert results.count(locked_out) + results.count(refused) == count - 1, results
+    for line in lost:
+        site.expect("status", re.escape(line), times=results.count(locked_out))
+
+
+def open_end(descriptor):
+    """The other end of a pipe: None while it is silent and open, else what can be read; b"" is its end."""
+    ready, _, _ = select.select([descriptor], [], [], 0)
+    return os.read(descriptor, 100) if ready else None
+
+
+def test_what_the_caller_left_open_is_closed_in_the_daemon(site):
+    """A caller that waits for the end of a pipe is not held up for the life of the server."""
+    near, far = os.pipe()
+    high = fcntl.fcntl(far, fcntl.F_DUPFD, 300)
+    with open(site.scratch / "left-open", "w") as file:
+        _, _, daemon = site.start_daemon(pass_fds=(far, high, file.fileno()))
+        left = str(site.scratch / "left-open")
+    os.close(far)
+    os.close(high)
+    assert open_end(near) == b""
+    os.close(near)
+    assert daemon.alive()
+    assert left not in descriptors(daemon.pid).values()
+    assert site.get("/hello.htm").status == 200
 
 
 def test_start_with_closed_standard_streams(site):

@@ -1,7 +1,6 @@
 """The access log and the message log: formats, switches, levels."""
 
 import re
-import socket
 import time
 
 import pytest
@@ -14,6 +13,7 @@ from harness import (
     ACCESS_LINE,
     Background,
     request_text,
+    shown_host_name,
     wait_until,
 )
 
@@ -212,7 +212,7 @@ def test_the_screen_and_the_status_log_at_level_10(site):
     site.configure(audit={"debuglevel": 10})
     server = site.serve(shell=EQUAL_SOFT_LIMIT)
     server.stop()
-    host = socket.gethostname()[:63] or "local"
+    host = shown_host_name()
     lines = [
         f"Changing dir to {site.root};",
         *(["gid=0 egid=0", "uid=0 euid=0"] if IS_ROOT else []),
@@ -229,7 +229,7 @@ def test_the_screen_and_the_status_log_at_level_10(site):
 
 def test_the_screen_at_the_usual_level(site, server):
     server.stop()
-    host = socket.gethostname()[:63] or "local"
+    host = shown_host_name()
     assert server.stdout() == (
         BANNER + DEBUG_NOTICE + f"Remote interface server available on http://{host}:{site.port}.\n"
         f"The remote configuration server has been started ({server.pid}).\n"

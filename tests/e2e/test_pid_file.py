@@ -239,6 +239,24 @@ def test_pid_file_and_start_up_log_are_named_after_the_program(site, name, stem)
     assert not (folder / f"{stem}.pid").exists()
 
 
+@pytest.mark.parametrize("form", ["./ox_remote", "ox_remote", "absolute"])
+@pytest.mark.parametrize("name", ["back\\slash", "\\", "two  blanks ", " dir.with\\all . "], ids=repr)
+def test_any_name_of_the_installation_directory_will_do(site, name, form):
+    site.rename(name)
+    argv0 = str(site.exe) if form == "absolute" else form
+    assert site.run("-status", argv0=argv0) == (1, BANNER + not_running(2))
+    server = site.serve(argv0=argv0)
+    assert site.get("/hello.htm").status == 200
+    assert site.pid_file.read_text() == f"{server.pid}\n"
+    assert os.readlink(f"/proc/{server.pid}/cwd") == str(site.root)
+    assert site.run("-status", argv0=argv0)[0] == 0
+    code, out = site.run("-stop", argv0=argv0)
+    assert code == 0 and out.endswith("The server has been stopped.\n")
+    assert server.wait_exit() == 0
+    assert not site.pid_file.exists()
+    assert sorted(path.name for path in site.scratch.iterdir() if path.is_dir()) == sorted([name, "sanitizer"])
+
+
 @needs_root
 def test_the_pid_file_of_a_server_under_another_user_belongs_to_that_user(site):
     site.configure(unix={"uid": 1, "gid": 1})

@@ -4,7 +4,18 @@ import os
 
 import pytest
 
-from harness import BANNER, DEAD_PID, IS_ROOT, NOBODY, free_port, is_listening, not_running, wait_until
+from harness import (
+    BANNER,
+    DEAD_PID,
+    IS_ROOT,
+    NOBODY,
+    SLOWDOWN,
+    free_port,
+    is_listening,
+    not_running,
+    spoil_settings,
+    wait_until,
+)
 
 UNREADABLE = "Error: unable to read configuration files."
 OPTIONS = ["-start", "-stop", "-status", "-debug", "-bogus"]
@@ -22,16 +33,14 @@ def test_a_missing_settings_file_refuses_every_option(site, missing):
 
 
 @pytest.mark.parametrize("broken", ["ox_remote.ini", "oxm_oxx/oxm_oxx.ini"])
-@pytest.mark.parametrize("kind", ["directory", "nul"])
+@pytest.mark.parametrize("kind", ["directory", "nul", "pipe", "device"])
 def test_a_settings_file_that_does_not_load_is_named(site, broken, kind):
-    path = site.root / broken
-    if kind == "directory":
-        path.unlink()
-        path.mkdir()
-    else:
-        path.write_bytes(path.read_bytes() + b"[x]\ny=\0z\n")
-    for option in OPTIONS:
-        assert site.run(option, stderr=exception_line(f"./{broken}")) == (1, UNREADABLE)
+    """At once: no command waits for somebody who writes to a pipe, or for the end of a device."""
+    spoil_settings(site.root / broken, kind)
+    for arguments in [[option] for option in OPTIONS] + [[]]:
+        out = site.run(*arguments, stderr=exception_line(f"./{broken}"), timeout=3 * SLOWDOWN)
+        assert out == (1, UNREADABLE)
+    assert not site.pid_file.exists()
 
 
 @pytest.mark.parametrize("broken", ["ox_remote.ini", "oxm_oxx/oxm_oxx.ini"])

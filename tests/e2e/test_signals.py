@@ -10,12 +10,14 @@ import pytest
 from harness import (
     Client,
     SANITIZER,
+    SLOWDOWN,
     free_port,
     is_alive,
     is_listening,
     port_in_use_line,
     request_text,
     signals_in_mask,
+    spoil_settings,
     stays_true,
     wait_until,
 )
@@ -281,18 +283,34 @@ def test_a_server_stopped_by_a_failed_reset_can_be_stopped(site, server):
     site.expect("err", re.escape(port_in_use_line(port)), times=1)
 
 
-def test_a_reset_without_a_settings_file_leaves_the_server_stopped(site, server):
-    text = site.ini.read_bytes()
-    site.ini.unlink()
+@pytest.mark.parametrize("kind", ["missing", "directory", "nul", "pipe", "device"])
+def test_a_reset_without_settings_that_load_leaves_the_server_stopped(site, server, kind):
+    """It waits for the next reset, answers status requests and can be ended."""
+
+    def spoil(times):
+        reason = spoil_settings(site.ini, kind)
+        line = f"Error: can't read ./ox_remote.ini: {reason}"
+        server.signal(RESET)
+        wait_until(lambda: site.status().count(line) == times, "the line of the failed reset", timeout=5 * SLOWDOWN)
+        assert not is_listening(site.port)
+        assert ask_status(site, server) == "Remote interface server is stopped."
+        if kind == "directory":
+            site.ini.rmdir()
+        return line
+
+    spoil(times=1)
+    site.configure()
     server.signal(RESET)
-    wait_until(lambda: not is_listening(site.port), "the server is stopped")
-    assert ask_status(site, server) == "Remote interface server is stopped."
-    site.expect("status", r"Remote interface server is stopped\.", times=1)
-    site.expect("status", r"Error: can't read \./ox_remote\.ini: No such file or directory", times=1)
-    site.ini.write_bytes(text)
-    server.signal(RESET)
-    wait_until(lambda: is_listening(site.port), "the second start")
+    wait_until(lambda: is_listening(site.port), "the next good start")
     assert site.get("/hello.htm").status == 200
+    assert ask_status(site, server) == f"Remote interface server is active on port {site.port}."
+
+    line = spoil(times=2)
+    server.signal(signal.SIGTERM)
+    assert server.wait_exit() == 0
+    assert not site.pid_file.exists()
+    site.expect("status", re.escape(line), times=2)
+    site.expect("status", r"Remote interface server is stopped\.", times=2)
 
 
 def test_connections_that_were_accepted_live_through_resets(site):

@@ -251,6 +251,24 @@ def test_user_id_65535_is_named_a_security_risk(site):
     site.expect("status", re.escape(line), times=1)
 
 
+@needs_root
+@pytest.mark.parametrize("level", [1, 7])
+def test_user_id_minus_1_is_refused_by_the_system_and_named_a_security_risk(site, level):
+    site.configure(unix={"uid": -1}, audit={"debuglevel": level})
+    server = site.serve()
+    server.expected_stderr = "seteuid: Invalid argument"
+    assert process_status(server.pid)["Uid"].split() == ["0"] * 4
+    assert site.get("/hello.htm").status == 200
+    warning = "Warning: running as uid -1 is a security risk."
+    identity = [line for line in site.status() if "uid" in line or "gid" in line]
+    if level == 7:
+        assert identity == ["gid=0 egid=0", "seteuid: Invalid argument", "uid=0 euid=0", warning]
+        site.expect("status", "seteuid: Invalid argument", times=1)
+    else:
+        assert identity == [warning]
+    site.expect("status", re.escape(warning), times=1)
+
+
 def test_an_ordinary_user_runs_the_server(site):
     site.configure(audit={"debuglevel": 9})
     site.use_ordinary_user()

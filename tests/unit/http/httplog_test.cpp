@@ -1,9 +1,11 @@
 #include "http/httplog.h"
 
+#include <fcntl.h>
 #include <gtest/gtest.h>
 #include <sys/socket.h>
 #include <unistd.h>
 
+#include "protocol/testsockets.h"
 #include "testing/manualclock.h"
 #include "testing/scratch.h"
 
@@ -82,6 +84,31 @@ TEST(AccessLogLine, FollowsTheRequest) {
         const oxReply reply(Http::NOT_FOUND_404);
         EXPECT_EQ(oxHttpServerLog::FormatLine(oxSockAddr(0x0a000001U), *request, &reply, NOW, 0), c.line) << c.request;
     }
+}
+
+TEST(AccessLogLine, OfASentFileCountsItsBytes) {
+    const Zone zone("UTC0");
+    const Scratch dir;
+    oxRequest request;
+    Fill(request, "GET /a?b=c HTTP/1.0\r\n\r\n");
+    UniqueFd file = OpenFile(dir.Write("a", std::string(1234, 'x')), O_RDONLY);
+    ASSERT_TRUE(file);
+    oxReply reply(Http::OK_200, Http::TYPE_HTML, file.Release(), 1234, nullptr);
+    Connection connection(Connection::TCP);
+    const ManualClock clock(NOW);
+    oxTimeStamp activity(clock);
+    LineLog errors;
+    reply.Send(connection.Server(), activity, errors);
+    connection.Server().Close();
+    EXPECT_TRUE(connection.PeerReadAll().ends_with("\r\n\r\n" + std::string(1234, 'x')));
+    EXPECT_TRUE(errors.Lines().empty());
+
+    const std::string line = "10.0.0.1 - - [6/Nov/1994:8:49:37 -0000] \"GET /a HTTP/1.0\" 200 1234";
+    EXPECT_EQ(oxHttpServerLog::FormatLine(oxSockAddr(0x0a000001U), request, &reply, NOW, 0), line);
+    oxHttpServerLog log;
+    ASSERT_TRUE(log.Open(dir.File("access").c_str(), "a"));
+    log.LogRequest(oxSockAddr(0x0a000001U), request, &reply, NOW);
+    EXPECT_EQ(dir.Read("access"), line + "\n");
 }
 
 TEST(AccessLogLine, WithoutAReplyReads400) {

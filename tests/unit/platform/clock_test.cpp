@@ -2,16 +2,7 @@
 
 #include <gtest/gtest.h>
 
-namespace {
-
-class HandClock : public oxClock {
-public:
-    std::time_t Now() const override { return 1000000000; }
-    std::int64_t MonotonicSeconds() const override { return seconds; }
-    std::int64_t seconds = 5;
-};
-
-}  // namespace
+#include "testing/manualclock.h"
 
 TEST(oxClock, SystemGivesTheMachinesClocks) {
     const std::time_t before = std::time(nullptr);
@@ -28,13 +19,14 @@ TEST(oxClock, SystemGivesTheMachinesClocks) {
 }
 
 TEST(oxTimeStamp, IsZeroUntilTouched) {
-    HandClock clock;
+    ManualClock clock;
+    const std::int64_t begin = clock.MonotonicSeconds();
     oxTimeStamp stamp(clock);
     EXPECT_EQ(0, stamp.Seconds());
     stamp.Touch();
-    EXPECT_EQ(5, stamp.Seconds());
-    clock.seconds = 9;
-    EXPECT_EQ(5, stamp.Seconds());
+    EXPECT_EQ(begin, stamp.Seconds());
+    clock.Advance(4);
+    EXPECT_EQ(begin, stamp.Seconds());
     stamp.Touch();
-    EXPECT_EQ(9, stamp.Seconds());
+    EXPECT_EQ(begin + 4, stamp.Seconds());
 }

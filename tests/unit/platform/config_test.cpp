@@ -8,8 +8,9 @@
 #include <climits>
 #include <thread>
 
-#include "platform/support_tempdir.h"
+#include "testing/scratch.h"
 
+using namespace std::string_literals;
 using namespace std::string_view_literals;
 
 namespace {
@@ -185,25 +186,27 @@ TEST(oxConfig, AnObjectThatWasNotLoadedHasNoKeys) {
 }
 
 TEST(oxConfig, OpensFilesAndSaysWhyNot) {
-    const TempDir directory;
+    const Scratch directory;
     directory.Write("good.ini", "[s]\nk=v\n");
-    directory.Write("nul.ini", "[s]\nk=v\n\0"sv);
+    directory.Write("nul.ini", "[s]\nk=v\n\0"s);
     directory.Write("empty.ini", "");
+    ASSERT_EQ(0, mkfifo(directory.File("pipe.ini").c_str(), 0600));
     struct Case {
         std::string path;
         const char* error;
     };
     const Case cases[] = {
-        {directory / "missing.ini", "No such file or directory"},
+        {directory.File("missing.ini"), "No such file or directory"},
         {directory.Path(), "Is a directory"},
-        {directory / "nul.ini", "The file holds a NUL byte"},
-        {directory / "good.ini/x", "Not a directory"},
+        {directory.File("nul.ini"), "The file holds a NUL byte"},
+        {directory.File("pipe.ini"), "Invalid argument"},
+        {directory.File("good.ini/x"), "Not a directory"},
     };
     oxConfig config;
     for (const Case& c : cases) {
-        EXPECT_TRUE(config.Open(directory / "good.ini"));
+        EXPECT_TRUE(config.Open(directory.File("good.ini")));
         EXPECT_TRUE(config.IsOpen());
-        EXPECT_EQ(directory / "good.ini", config.Path());
+        EXPECT_EQ(directory.File("good.ini"), config.Path());
         EXPECT_EQ("", config.ErrorText());
         EXPECT_EQ("v", config.GetText("s", "k", ""));
         EXPECT_FALSE(config.Open(c.path));
@@ -212,13 +215,13 @@ TEST(oxConfig, OpensFilesAndSaysWhyNot) {
         EXPECT_EQ(c.error, config.ErrorText());
         EXPECT_FALSE(config.HasKey("s", "k")) << "nothing of the earlier file is left";
     }
-    EXPECT_TRUE(config.Open(directory / "empty.ini"));
+    EXPECT_TRUE(config.Open(directory.File("empty.ini")));
 }
 
 TEST(oxConfig, FileWithoutPermissionDoesNotLoad) {
-    const TempDir directory;
+    const Scratch directory;
     directory.Write("closed.ini", "[s]\nk=v\n");
-    ASSERT_EQ(0, chmod((directory / "closed.ini").c_str(), 0));
+    ASSERT_EQ(0, chmod((directory.File("closed.ini")).c_str(), 0));
     // Root reads everything, so its part is played by a thread that is root no more.
     std::thread([&] {
         if (geteuid() == 0) {
@@ -226,7 +229,7 @@ TEST(oxConfig, FileWithoutPermissionDoesNotLoad) {
             ASSERT_EQ(0, syscall(SYS_setresuid, ORDINARY_USER, ORDINARY_USER, ORDINARY_USER));
         }
         oxConfig config;
-        EXPECT_FALSE(config.Open(directory / "closed.ini"));
+        EXPECT_FALSE(config.Open(directory.File("closed.ini")));
         EXPECT_FALSE(config.IsOpen());
         EXPECT_EQ("Permission denied", config.ErrorText());
     }).join();

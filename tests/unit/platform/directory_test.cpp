@@ -8,7 +8,7 @@
 #include <filesystem>
 #include <thread>
 
-#include "platform/support_tempdir.h"
+#include "testing/scratch.h"
 
 namespace {
 
@@ -45,7 +45,7 @@ private:
 }  // namespace
 
 TEST(oxDirIterator, ListsWhatMatchesInOneOrder) {
-    const TempDir directory;
+    const Scratch directory;
     for (const char* name : {"zoe.usr", "adam.usr", "Bob.usr", "x.usr~", ".hidden.usr", "usr", "a b.usr"})
         directory.Write(name, "");
     EXPECT_EQ((Names{"Bob.usr", "a b.usr", "adam.usr", "zoe.usr"}), NamesIn(directory.Path(), "*.usr"));
@@ -57,65 +57,65 @@ TEST(oxDirIterator, ListsWhatMatchesInOneOrder) {
 }
 
 TEST(oxDirIterator, SaysWhyADirectoryCannotBeListed) {
-    const TempDir directory;
+    const Scratch directory;
     directory.Write("file", "");
-    oxDirIterator missing(directory / "missing", "*");
+    oxDirIterator missing(directory.File("missing"), "*");
     EXPECT_FALSE(missing.IsValid());
     EXPECT_EQ(ENOENT, missing.Error());
     EXPECT_EQ(nullptr, missing.Next());
-    const oxDirIterator file(directory / "file", "*");
+    const oxDirIterator file(directory.File("file"), "*");
     EXPECT_EQ(ENOTDIR, file.Error());
 }
 
 TEST(CreateDir, MakesTheDirectoriesAboveToo) {
     const mode_t mask = umask(0);
-    const TempDir directory;
-    EXPECT_TRUE(CreateDir(directory / "a/b//c/", PRIVATE_DIRECTORY_MODE));
+    const Scratch directory;
+    EXPECT_TRUE(CreateDir(directory.File("a/b//c/"), PRIVATE_DIRECTORY_MODE));
     umask(mask);
-    EXPECT_EQ(DIRECTORY_MODE, ModeOf(directory / "a"));
-    EXPECT_EQ(DIRECTORY_MODE, ModeOf(directory / "a/b"));
-    EXPECT_EQ(PRIVATE_DIRECTORY_MODE, ModeOf(directory / "a/b/c"));
-    EXPECT_TRUE(CreateDir(directory / "a/b/c")) << "an existing one is success";
-    EXPECT_EQ(PRIVATE_DIRECTORY_MODE, ModeOf(directory / "a/b/c")) << "and is left as it is";
+    EXPECT_EQ(DIRECTORY_MODE, ModeOf(directory.File("a")));
+    EXPECT_EQ(DIRECTORY_MODE, ModeOf(directory.File("a/b")));
+    EXPECT_EQ(PRIVATE_DIRECTORY_MODE, ModeOf(directory.File("a/b/c")));
+    EXPECT_TRUE(CreateDir(directory.File("a/b/c"))) << "an existing one is success";
+    EXPECT_EQ(PRIVATE_DIRECTORY_MODE, ModeOf(directory.File("a/b/c"))) << "and is left as it is";
 }
 
 TEST(CreateDir, TakesRelativeNamesAndTheRoot) {
-    const TempDir directory;
+    const Scratch directory;
     const WorkIn work(directory.Path());
     EXPECT_TRUE(CreateDir("./x/y"));
     EXPECT_TRUE(CreateDir("z"));
     EXPECT_TRUE(CreateDir("."));
     EXPECT_TRUE(CreateDir("/"));
-    EXPECT_TRUE(std::filesystem::is_directory(directory / "x/y"));
-    EXPECT_TRUE(std::filesystem::is_directory(directory / "z"));
+    EXPECT_TRUE(std::filesystem::is_directory(directory.File("x/y")));
+    EXPECT_TRUE(std::filesystem::is_directory(directory.File("z")));
 }
 
 TEST(CreateDir, TakesALinkToADirectory) {
-    const TempDir directory;
-    ASSERT_TRUE(CreateDir(directory / "real"));
-    std::filesystem::create_symlink("real", directory / "link");
-    EXPECT_TRUE(CreateDir(directory / "link"));
-    EXPECT_TRUE(CreateDir(directory / "link/below"));
-    EXPECT_TRUE(std::filesystem::is_directory(directory / "real/below"));
+    const Scratch directory;
+    ASSERT_TRUE(CreateDir(directory.File("real")));
+    std::filesystem::create_symlink("real", directory.File("link"));
+    EXPECT_TRUE(CreateDir(directory.File("link")));
+    EXPECT_TRUE(CreateDir(directory.File("link/below")));
+    EXPECT_TRUE(std::filesystem::is_directory(directory.File("real/below")));
 }
 
 TEST(CreateDir, FailsWithErrno) {
-    const TempDir directory;
+    const Scratch directory;
     directory.Write("file", "");
-    EXPECT_FALSE(CreateDir(directory / "file"));
+    EXPECT_FALSE(CreateDir(directory.File("file")));
     EXPECT_EQ(ENOTDIR, errno);
-    EXPECT_FALSE(CreateDir(directory / "file/below"));
+    EXPECT_FALSE(CreateDir(directory.File("file/below")));
     EXPECT_EQ(ENOTDIR, errno);
     EXPECT_FALSE(CreateDir(""));
     EXPECT_EQ(ENOENT, errno);
-    EXPECT_FALSE(CreateDir(directory / std::string(300, 'n')));
+    EXPECT_FALSE(CreateDir(directory.File(std::string(300, 'n'))));
     EXPECT_EQ(ENAMETOOLONG, errno);
 }
 
 TEST(CreateDir, MayRunTwiceAtTheSameTime) {
-    const TempDir directory;
+    const Scratch directory;
     for (int round = 0; round < 50; ++round) {
-        const std::string path = directory / (std::to_string(round) + "/a/b/c");
+        const std::string path = directory.File(std::to_string(round) + "/a/b/c");
         bool first = false;
         bool second = false;
         std::thread other([&] { first = CreateDir(path); });
@@ -126,10 +126,10 @@ TEST(CreateDir, MayRunTwiceAtTheSameTime) {
 }
 
 TEST(GetFullDirectoryName, ResolvesWhatExists) {
-    const TempDir directory;
+    const Scratch directory;
     const std::string real = std::filesystem::canonical(directory.Path());
-    ASSERT_TRUE(CreateDir(directory / "real/sub"));
-    std::filesystem::create_symlink("real", directory / "link");
+    ASSERT_TRUE(CreateDir(directory.File("real/sub")));
+    std::filesystem::create_symlink("real", directory.File("link"));
     const WorkIn work(directory.Path());
     struct Case {
         std::string name;
@@ -141,7 +141,7 @@ TEST(GetFullDirectoryName, ResolvesWhatExists) {
         {"real/", real + "/real"},
         {"link/sub", real + "/real/sub"},
         {"./real/../link", real + "/real"},
-        {directory / "link", real + "/real"},
+        {directory.File("link"), real + "/real"},
         {"/", "/"},
     };
     for (const Case& c : cases) {
@@ -152,7 +152,7 @@ TEST(GetFullDirectoryName, ResolvesWhatExists) {
 }
 
 TEST(GetFullDirectoryName, JoinsWhatDoesNotExist) {
-    const TempDir directory;
+    const Scratch directory;
     const std::string real = std::filesystem::canonical(directory.Path());
     const WorkIn work(directory.Path());
     struct Case {
@@ -186,10 +186,10 @@ TEST(GetFullDirectoryName, RefusesWhatIsTooLong) {
 }
 
 TEST(GetFullDirectoryName, FailsWithoutAWorkingDirectory) {
-    const TempDir directory;
-    ASSERT_TRUE(CreateDir(directory / "gone"));
-    const WorkIn work(directory / "gone");
-    std::filesystem::remove(directory / "gone");
+    const Scratch directory;
+    ASSERT_TRUE(CreateDir(directory.File("gone")));
+    const WorkIn work(directory.File("gone"));
+    std::filesystem::remove(directory.File("gone"));
     std::string full;
     EXPECT_FALSE(GetFullDirectoryName("x", full));
     EXPECT_EQ(ENOENT, errno);

@@ -10,7 +10,7 @@
 #include <string>
 #include <thread>
 
-#include "platform/support_tempdir.h"
+#include "testing/scratch.h"
 
 namespace {
 
@@ -22,6 +22,15 @@ mode_t ModeOf(const std::string& path) {
     struct stat status {};
     return stat(path.c_str(), &status) == 0 ? status.st_mode & 07777 : 0;
 }
+
+// Ends the program when what follows hangs.
+class AlarmAfter {
+public:
+    explicit AlarmAfter(unsigned seconds) { alarm(seconds); }
+    ~AlarmAfter() { alarm(0); }
+    AlarmAfter(const AlarmAfter&) = delete;
+    AlarmAfter& operator=(const AlarmAfter&) = delete;
+};
 
 class UmaskFor {
 public:
@@ -74,44 +83,108 @@ TEST(UniqueFd, MovesReleasesAndResets) {
 
 TEST(OpenFile, IsClosedOnExecAndCreatesWithTheMode) {
     const UmaskFor mask(0);
-    const TempDir directory;
-    const std::string path = directory / "new";
+    const Scratch directory;
+    const std::string path = directory.File("new");
     const UniqueFd file = OpenFile(path, O_WRONLY | O_CREAT);
     ASSERT_TRUE(file);
     EXPECT_EQ(FD_CLOEXEC, fcntl(file.Get(), F_GETFD));
     EXPECT_EQ(PRIVATE_FILE_MODE, ModeOf(path));
-    const std::string log = directory / "log";
+    const std::string log = directory.File("log");
     EXPECT_TRUE(OpenFile(log, O_WRONLY | O_CREAT, LOG_FILE_MODE));
     EXPECT_EQ(LOG_FILE_MODE, ModeOf(log));
 }
 
 TEST(OpenFile, FailureLeavesErrno) {
-    const TempDir directory;
-    EXPECT_FALSE(OpenFile(directory / "missing", O_RDONLY));
+    const Scratch directory;
+    EXPECT_FALSE(OpenFile(directory.File("missing"), O_RDONLY));
     EXPECT_EQ(ENOENT, errno);
 }
 
 TEST(ReadWholeFile, GivesEveryByte) {
-    const TempDir directory;
+    const Scratch directory;
     for (const std::size_t size : {0u, 1u, 16383u, 16384u, 16385u, 100000u}) {
         std::string content(size, 'x');
         if (size > 1)
             content[size / 2] = '\0';
         directory.Write("file", content);
         std::string read = "old";
-        EXPECT_TRUE(ReadWholeFile(directory / "file", read));
+        EXPECT_TRUE(ReadWholeFile(directory.File("file"), read));
         EXPECT_EQ(content, read) << size;
     }
 }
 
 TEST(ReadWholeFile, FailsForDirectoriesAndMissingFiles) {
-    const TempDir directory;
+    const Scratch directory;
     std::string content = "old";
     EXPECT_FALSE(ReadWholeFile(directory.Path(), content));
     EXPECT_EQ(EISDIR, errno);
-    EXPECT_FALSE(ReadWholeFile(directory / "missing", content));
+    EXPECT_FALSE(ReadWholeFile(directory.File("missing"), content));
     EXPECT_EQ(ENOENT, errno);
     EXPECT_EQ("", content);
+}
+
+TEST(ReadWholeFile, RefusesAPipeAtOnceWithOrWithoutAWriter) {
+    const Scratch directory;
+    const std::string path = directory.File("pipe");
+    ASSERT_EQ(0, mkfifo(path.c_str(), 0600));
+    UniqueFd writing;
+    for (const bool written : {false, true}) {
+        if (written) {
+            writing = OpenFile(path, O_RDWR);
+            ASSERT_TRUE(writing);
+            ASSERT_TRUE(WriteAll(writing.Get(), "text", 4));
+        }
+        std::string content = "old";
+        const AlarmAfter noHanging(20);
+        EXPECT_FALSE(ReadWholeFile(path, content)) << written;
+        EXPECT_EQ(EINVAL, errno) << written;
+        EXPECT_EQ("", content) << written;
+    }
+}
+
+TEST(ReadWholeFile, RefusesADevice) {
+    std::string content = "old";
+    EXPECT_FALSE(ReadWholeFile("/dev/zero", content));
+    EXPECT_EQ(EINVAL, errno);
+    EXPECT_EQ("", content);
+}
+
+TEST(DuplicateOnto, MakesAnotherNumberOfTheSameFileWithoutCloseOnExec) {
+    const Scratch directory;
+    const UniqueFd from = OpenFile(directory.Write("from", "abcdef"), O_RDONLY);
+    const UniqueFd to = OpenFile("/dev/null", O_RDONLY);
+    ASSERT_TRUE(from);
+    ASSERT_TRUE(to);
+    ASSERT_EQ(FD_CLOEXEC, fcntl(to.Get(), F_GETFD));
+    EXPECT_TRUE(DuplicateOnto(from.Get(), to.Get()));
+    EXPECT_EQ(0, fcntl(to.Get(), F_GETFD));
+    EXPECT_EQ(FD_CLOEXEC, fcntl(from.Get(), F_GETFD)) << "the first number stays as it was";
+    EXPECT_EQ(3, lseek(from.Get(), 3, SEEK_SET));
+    char next = 0;
+    EXPECT_EQ(1, read(to.Get(), &next, 1));
+    EXPECT_EQ('d', next) << "both share one position";
+}
+
+TEST(DuplicateOnto, TakesANumberThatIsNotOpen) {
+    const UniqueFd from = OpenFile("/dev/null", O_RDONLY);
+    int number = -1;
+    {
+        const UniqueFd free(fcntl(from.Get(), F_DUPFD_CLOEXEC, 100));
+        number = free.Get();
+    }
+    ASSERT_FALSE(IsOpenDescriptor(number));
+    ASSERT_TRUE(DuplicateOnto(from.Get(), number));
+    const UniqueFd made(number);
+    EXPECT_TRUE(IsOpenDescriptor(number));
+}
+
+TEST(DuplicateOnto, FailureLeavesErrnoAndTheTargetOpen) {
+    const UniqueFd to = OpenFile("/dev/null", O_RDONLY);
+    EXPECT_FALSE(DuplicateOnto(-1, to.Get()));
+    EXPECT_EQ(EBADF, errno);
+    EXPECT_TRUE(IsOpenDescriptor(to.Get()));
+    EXPECT_FALSE(DuplicateOnto(to.Get(), -1));
+    EXPECT_EQ(EBADF, errno);
 }
 
 TEST(WriteAll, WritesThroughShortWrites) {

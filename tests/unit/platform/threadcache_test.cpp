@@ -25,7 +25,7 @@ int StartCounted(void* (*entry)(void*), void* argument) {
 
 // Never destroyed, as its users do it: threads may still wait in it.
 MThreadCache& NewCache() {
-    static std::vector<MThreadCache*> caches;
+    static auto& caches = *new std::vector<MThreadCache*>;
     started = 0;
     return *caches.emplace_back(new MThreadCache(&StartCounted));
 }

@@ -1,6 +1,5 @@
 #include "protocol/reply.h"
 
-#include <fcntl.h>
 #include <gtest/gtest.h>
 #include <sys/mman.h>
 
@@ -9,60 +8,9 @@
 #include <thread>
 #include <vector>
 
-#include "protocol/testsockets.h"
-#include "testing/manualclock.h"
+#include "protocol/replytools.h"
 
 namespace {
-
-const std::string DATE = "Date: Sun, 06 Nov 1994 08:49:37 GMT\r\n";
-const std::string EXPIRES = "Expires: Tue, 06 Dec 1994 08:49:37 GMT\r\n";
-const std::string SERVER = "Server: Orvex HTTP Server V3.5c\r\n";
-const std::string ALLOW = "Allow: GET, POST\r\n";
-
-std::string OkHeader(const std::string& type) {
-    return "HTTP/1.0 200 OK\r\n" + SERVER + ALLOW + "Content-Type: " + type + "\r\n" + DATE + "\r\n";
-}
-
-// A descriptor from which the content is read.
-int FileOf(const std::string& content) {
-    const int file = ::memfd_create("body", MFD_CLOEXEC);
-    EXPECT_GE(file, 0);
-    EXPECT_TRUE(WriteAll(file, content.data(), content.size()));
-    ::lseek(file, 0, SEEK_SET);
-    return file;
-}
-
-bool IsOpen(int descriptor) {
-    return ::fcntl(descriptor, F_GETFD) != -1;
-}
-
-struct Sent {
-    std::string text;
-    std::vector<std::string> lines;
-    std::uint32_t bytes;
-    std::int64_t touched;
-};
-
-Sent Send(oxReply& reply, Connection::Kind kind = Connection::STREAM) {
-    Connection connection(kind);
-    LineLog log;
-    ManualClock clock;
-    oxTimeStamp stamp(clock);
-    reply.SetClock(clock);
-    std::string text;
-    std::jthread peer([&] { text = connection.PeerReadAll(); });
-    reply.Send(connection.Server(), stamp, log);
-    connection.Server().Shutdown(SHUT_WR);
-    peer.join();
-    return {text, log.Lines(), reply.GetBytesSent(), stamp.Seconds()};
-}
-
-// Puts a function into the socket's table for the life of the object.
-class SendStub {
-public:
-    explicit SendStub(ssize_t (*function)(int, const void*, size_t, int)) { oxSocket::m_lpfnsend = function; }
-    ~SendStub() { oxSocket::m_lpfnsend = ::send; }
-};
 
 TEST(OxReply, HeaderTable) {
     const struct {
@@ -233,16 +181,6 @@ TEST(OxReply, TimeStampIsTouchedBeforeEveryBlock) {
     }
 }
 
-TEST(OxReply, ReadErrorOnTheFirstBlockSendsNothing) {
-    const int directory = ::open("/", O_RDONLY | O_CLOEXEC);
-    ASSERT_GT(directory, 0);
-    oxReply reply(Http::OK_200, Http::TYPE_HTML, directory, 0, nullptr);
-    const Sent sent = Send(reply);
-    EXPECT_EQ("", sent.text);
-    EXPECT_EQ(std::vector<std::string>{"Reply error reading file - handle = " + std::to_string(directory)}, sent.lines);
-    EXPECT_FALSE(IsOpen(directory));
-}
-
 TEST(OxReply, SendErrorEndsTheReply) {
     static int calls;
     calls = 0;
@@ -292,35 +230,6 @@ TEST(OxReply, CloseByAnotherThreadEndsABlockedReply) {
         EXPECT_TRUE(log.Lines()[0].starts_with("Reply error writing to socket - socket error = ")) << log.Lines()[0];
         EXPECT_FALSE(IsOpen(file));
     }
-}
-
-TEST(OxReply, DestructorClosesAnUnsentFile) {
-    const int file = FileOf("x");
-    { const oxReply reply(Http::OK_200, Http::TYPE_HTML, file, 0, nullptr); }
-    EXPECT_FALSE(IsOpen(file));
-}
-
-TEST(OxReply, ErrorStatusNeverReadsItsFile) {
-    const int file = FileOf("x");
-    {
-        oxReply reply(Http::FORBIDDEN_403, Http::TYPE_HTML, file, 0, nullptr);
-        EXPECT_EQ(reply.ComposeHeader(), Send(reply).text);
-        EXPECT_EQ(0, ::lseek(file, 0, SEEK_CUR));
-    }
-    EXPECT_FALSE(IsOpen(file));
-}
-
-TEST(OxReply, HandleZeroIsNeverClosed) {
-    // Descriptor 0 is put back afterwards, closed if it was.
-    const UniqueFd kept(::fcntl(0, F_DUPFD_CLOEXEC, 3));
-    const UniqueFd file(FileOf("x"));
-    ASSERT_EQ(0, ::dup2(file.Get(), 0));
-    {
-        oxReply reply(Http::OK_200, Http::TYPE_HTML, 0, 0, nullptr);
-        reply.CloseFile();
-    }
-    EXPECT_TRUE(IsOpen(0));
-    kept ? ::dup2(kept.Get(), 0) : ::close(0);
 }
 
 TEST(OxReply, UnreadBodyIsDrained) {

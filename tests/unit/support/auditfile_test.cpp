@@ -70,8 +70,16 @@ TEST(oxAuditFile, LevelDecidesWhatIsWritten) {
         int message;
         bool written;
     };
-    for (const Case& c : {Case{1, 1, true}, {1, 2, false}, {5, 5, true}, {5, 7, false}, {9, 9, true}, {0, 0, false},
-                          {0, 1, false}, {0, -1, false}, {1, 0, true}, {10, 10, true}}) {
+    for (const Case& c : {Case{1, 1, true},
+                          {1, 2, false},
+                          {5, 5, true},
+                          {5, 7, false},
+                          {9, 9, true},
+                          {0, 0, false},
+                          {0, 1, false},
+                          {0, -1, false},
+                          {1, 0, true},
+                          {10, 10, true}}) {
         Scratch dir;
         oxAuditFile log(dir.File("l.log").c_str(), "a");
         log.SetDebugLevel(c.level);
@@ -192,7 +200,7 @@ TEST(oxAuditFile, FilesAreNotWorldWritableUnderAnEmptyMask) {
     const mode_t before = umask(0);
     oxAuditFile log(dir.File("mode.log").c_str(), "a");
     umask(before);
-    struct stat status{};
+    struct stat status {};
     ASSERT_EQ(stat(dir.File("mode.log").c_str(), &status), 0);
     EXPECT_EQ(status.st_mode & 07777u, 0644u);
     EXPECT_EQ(fcntl(fileno(log.GetStream()), F_GETFD) & FD_CLOEXEC, FD_CLOEXEC);

@@ -18,7 +18,7 @@ int Sleep() {
 }  // namespace
 
 INSTANTIATE_TEST_SUITE_P(By, OxProcessWatch, testing::Values(Means::Descriptor, Means::Table),
-                         [](const auto& info) { return info.param == Means::Table ? "Table" : "Descriptor"; });
+                         [](const auto& made) { return made.param == Means::Table ? "Table" : "Descriptor"; });
 
 TEST_P(OxProcessWatch, AZombieHasEnded) {
     const pid_t child = StartChild(&Sleep);

@@ -119,7 +119,7 @@ TEST(OxSignals, WriteFailuresOfTheProcessItselfAreNoCommands) {
 
 TEST(OxSignals, TheEndOfAChildPassesAndASentSeventeenDoesNot) {
     TestSignals signals;
-    signals.endsOn = SIGVTALRM;      // above 17, so that it is taken after it
+    signals.endsOn = SIGVTALRM;    // above 17, so that it is taken after it
     RunInChild([] { return 0; });  // its notice is pending now
     kill(getpid(), SIGVTALRM);
     signals.Run();

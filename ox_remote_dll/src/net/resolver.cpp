@@ -16,7 +16,7 @@ namespace {
 // Guards the shared results of the C library's plain look-ups, which a table entry may stand for.
 MMutex s_lookUpMutex;
 constexpr std::size_t LOOK_UP_BUFFER = 8192;
-constexpr std::size_t MAX_LOOK_UP_BUFFER = 1024 * 1024;
+constexpr std::size_t MAX_LOOK_UP_BUFFER = std::size_t{1024} * 1024;
 
 // Makes a re-entrant look-up with as much room as its result needs. Each caller waits for its own answer only: a name
 // service that is slow for one thread holds up no other.

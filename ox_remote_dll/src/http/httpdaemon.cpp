@@ -22,7 +22,6 @@ oxHttpDaemon::~oxHttpDaemon() {
 bool oxHttpDaemon::StartDaemon(const std::string& address) {
     oxHttpErrorLog& log = m_server->MessageLog();
     Wait();  // for the last lines of a listener that ended on an error
-    m_addressText = address;
     m_stopRequested = false;
     m_stopWakeup.Clear();
     m_startErrorNumber = 0;
@@ -192,7 +191,8 @@ void oxHttpDaemon::HandleAcceptFailure(AcceptFailures& failures) {
         return;
     if (error != EBADF && MayReport(failures))
         m_server->MessageLog().Error("Socket::Accept error: %s (%d).", GetLastErrorText(error), error);
-    if (WaitReadable(m_stopWakeup.Descriptor(), failures.pause) == Readiness::TimedOut)
+    pollfd stop{.fd = m_stopWakeup.Descriptor(), .events = POLLIN, .revents = 0};
+    if (PollAll({&stop, 1}, failures.pause) == 0)
         m_server->SweepTimedOutSessions();
     failures.pause = std::min(failures.pause * 2, ACCEPT_PAUSE_MAX);
 }

@@ -79,7 +79,6 @@ private:
     std::atomic<bool> m_stopRequested{false};
     std::atomic<DaemonState> m_daemonState{STATE_ENDED};
     int m_startErrorNumber = 0;
-    std::string m_addressText;
     oxSocket m_listeningSocket;
     oxWakeup m_stopWakeup;
 };

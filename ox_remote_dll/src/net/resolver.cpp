@@ -18,32 +18,43 @@ MMutex s_lookUpMutex;
 constexpr std::size_t LOOK_UP_BUFFER = 8192;
 constexpr std::size_t MAX_LOOK_UP_BUFFER = std::size_t{1024} * 1024;
 
-// Makes a re-entrant look-up with as much room as its result needs. Each caller waits for its own answer only: a name
-// service that is slow for one thread holds up no other.
-template <typename LookUp>
-const hostent* LookUpHost(hostent& entry, std::vector<char>& room, LookUp lookUp) {
-    hostent* found = nullptr;
-    int error = 0;
-    for (room.resize(LOOK_UP_BUFFER);; room.resize(room.size() * 2)) {
-        const int result = lookUp(&entry, room.data(), room.size(), &found, &error);
-        if (result != ERANGE || room.size() >= MAX_LOOK_UP_BUFFER)
-            return result == 0 ? found : nullptr;
+// One look-up of a host. The C library's own function is called in its re-entrant form, with as much room as the result
+// needs, so each caller waits for its own answer only: a name service that is slow for one thread holds up no other.
+// Another function in the table is called as it is, one call at a time.
+class HostLookUp {
+public:
+    template <typename Function, typename Reentrant, typename... Arguments>
+    HostLookUp(Function entry, Function own, Reentrant reentrant, Arguments... arguments) {
+        if (entry != own) {
+            m_lock.lock();
+            m_found = entry(arguments...);
+            return;
+        }
+        int result = ERANGE;
+        int error = 0;
+        hostent* found = nullptr;
+        for (std::size_t room = LOOK_UP_BUFFER; result == ERANGE && room <= MAX_LOOK_UP_BUFFER; room *= 2) {
+            m_room.resize(room);
+            result = reentrant(arguments..., &m_own, m_room.data(), m_room.size(), &found, &error);
+        }
+        m_found = result == 0 ? found : nullptr;
     }
-}
+    // Null when nothing was found; lives as long as this object.
+    const hostent* Found() const { return m_found; }
+
+private:
+    std::unique_lock<MMutex> m_lock{s_lookUpMutex, std::defer_lock};
+    hostent m_own{};
+    std::vector<char> m_room;
+    const hostent* m_found = nullptr;
+};
+
 char s_hostName[oxSocket::MAX_HOSTNAME + 1];
 }  // namespace
 
 bool oxResolver::FindHost(const char* host, in_addr& address, sa_family_t& family) {
-    std::unique_lock lock(s_lookUpMutex, std::defer_lock);
-    hostent own;
-    std::vector<char> room;
-    const hostent* entry;
-    if (oxSocket::m_lpfngethostbyname == ::gethostbyname) {
-        entry = LookUpHost(own, room, [host](auto... arguments) { return gethostbyname_r(host, arguments...); });
-    } else {
-        lock.lock();
-        entry = oxSocket::m_lpfngethostbyname(host);
-    }
+    const HostLookUp lookUp(oxSocket::m_lpfngethostbyname, &::gethostbyname, &::gethostbyname_r, host);
+    const hostent* entry = lookUp.Found();
     if (entry == nullptr || entry->h_addr_list == nullptr || entry->h_addr_list[0] == nullptr)
         return false;
     const auto length = static_cast<std::size_t>(std::max(entry->h_length, 0));
@@ -53,18 +64,9 @@ bool oxResolver::FindHost(const char* host, in_addr& address, sa_family_t& famil
 }
 
 std::string oxResolver::NameOf(in_addr address, sa_family_t family) {
-    std::unique_lock lock(s_lookUpMutex, std::defer_lock);
-    hostent own;
-    std::vector<char> room;
-    const hostent* entry;
-    if (oxSocket::m_lpfngethostbyaddr == ::gethostbyaddr) {
-        entry = LookUpHost(own, room, [&address, family](auto... arguments) {
-            return gethostbyaddr_r(&address, sizeof address, family, arguments...);
-        });
-    } else {
-        lock.lock();
-        entry = oxSocket::m_lpfngethostbyaddr(&address, sizeof address, family);
-    }
+    const HostLookUp lookUp(oxSocket::m_lpfngethostbyaddr, &::gethostbyaddr, &::gethostbyaddr_r, &address,
+                            socklen_t{sizeof address}, int{family});
+    const hostent* entry = lookUp.Found();
     if (entry == nullptr || entry->h_name == nullptr)
         return {};
     return entry->h_name;

@@ -836,6 +836,40 @@ class Background:
             raise self.errors[0]
 
 
+class ResetLoad(Background):
+    """Clients that fetch one file again and again from a server that is reset meanwhile. A connection may be refused, or
+    reset without a byte while it waits in the queue of the listening socket; an answer that has begun is always whole."""
+
+    def __init__(self, port, url, content, count):
+        self.port, self.url, self.content = port, url, content
+        self.outcomes = {"whole": 0, "refused": 0, "dropped": 0}
+        self.ending = False
+        super().__init__(self._load, count)
+
+    def _load(self, _):
+        while not self.ending:
+            data = b""
+            try:
+                with Client(self.port) as client:
+                    client.send(request_text(self.url))
+                    while block := client.receive():
+                        data += block
+            except ConnectionRefusedError:
+                self.outcomes["refused"] += 1
+                time.sleep(0.001)
+                continue
+            except (ConnectionResetError, BrokenPipeError):
+                assert data == b"", f"cut after {len(data)} bytes"
+                self.outcomes["dropped"] += 1
+                continue
+            assert data.endswith(b"\r\n\r\n" + self.content), f"{len(data)} bytes"
+            self.outcomes["whole"] += 1
+
+    def stop(self):
+        self.ending = True
+        self.join()
+
+
 def spoil_settings(path, kind):
     """Replaces a settings file by something that does not load; what the system says to it is returned."""
     text = path.read_bytes()

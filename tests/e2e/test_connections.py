@@ -16,6 +16,7 @@ from harness import (
     SLOWDOWN,
     Background,
     Client,
+    ResetLoad,
     cpu_seconds,
     descriptors,
     has_symbol,
@@ -330,40 +331,17 @@ def test_resets_under_load_cut_no_answer_short(site, server):
     socket are reset without a byte; an answer that has begun is always whole."""
     content = hashlib.sha256(b"seed").digest() * 3000
     site.page("a.bin", content)
-    stop = []
-    outcomes = {"whole": 0, "refused": 0, "dropped": 0}
-
-    def load(_):
-        while not stop:
-            data = b""
-            try:
-                with Client(site.port) as client:
-                    client.send(request_text("/a.bin"))
-                    while block := client.receive():
-                        data += block
-            except ConnectionRefusedError:
-                outcomes["refused"] += 1
-                time.sleep(0.001)
-                continue
-            except (ConnectionResetError, BrokenPipeError):
-                assert data == b"", f"cut after {len(data)} bytes"
-                outcomes["dropped"] += 1
-                continue
-            assert data.endswith(b"\r\n\r\n" + content), f"{len(data)} bytes"
-            outcomes["whole"] += 1
-
-    clients = Background(load, 6)
+    clients = ResetLoad(site.port, "/a.bin", content, 6)
     rounds = 12 if not SANITIZER else 6
     for number in range(2, rounds + 2):
-        goal = outcomes["whole"] + 30
-        wait_until(lambda: outcomes["whole"] >= goal or clients.errors, "answers between the resets")
+        goal = clients.outcomes["whole"] + 30
+        wait_until(lambda: clients.outcomes["whole"] >= goal or clients.errors, "answers between the resets")
         server.signal(16)
         wait_until(
             lambda: sum(line.startswith("Starting server") for line in site.err()) == number, "the next start"
         )
-    stop.append(True)
-    clients.join()
+    clients.stop()
     assert site.get("/hello.htm").status == 200
     # A session that ends while the server is down finds no access log; each client has one session at a time.
     lines = sum('"GET /a.bin HTTP/1.0" 200' in line for line in site.access())
-    assert lines >= outcomes["whole"] - 6 * rounds
+    assert lines >= clients.outcomes["whole"] - 6 * rounds

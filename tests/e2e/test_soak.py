@@ -17,6 +17,7 @@ from harness import (
     SANITIZER,
     Background,
     Client,
+    ResetLoad,
     cpu_seconds,
     descriptors,
     is_listening,
@@ -95,28 +96,6 @@ def test_100_resets_under_load(site):
     content = os.urandom(40_000)
     site.page("a.bin", content)
     server = site.serve()
-    stop = []
-    outcomes = {"whole": 0, "refused": 0, "dropped": 0}
-
-    def load(_):
-        while not stop:
-            data = b""
-            try:
-                with Client(site.port) as client:
-                    client.send(request_text("/a.bin"))
-                    while block := client.receive():
-                        data += block
-            except ConnectionRefusedError:
-                outcomes["refused"] += 1
-                time.sleep(0.001)
-                continue
-            except (ConnectionResetError, BrokenPipeError):
-                assert data == b"", f"cut after {len(data)} bytes"
-                outcomes["dropped"] += 1
-                continue
-            assert data.endswith(b"\r\n\r\n" + content), f"{len(data)} bytes"
-            outcomes["whole"] += 1
-
     def accepted():
         return site.error_log.read_bytes().count(b"HttpDaemon thread: connected to 127.0.0.77.")
 
@@ -124,7 +103,7 @@ def test_100_resets_under_load(site):
         return site.error_log.read_bytes().count(b": Starting server: ")
 
     memory = descriptors_before = None
-    clients = Background(load, 8)
+    clients = ResetLoad(site.port, "/a.bin", content, 8)
     for number in range(1, 101):
         held = Client(site.port, source="127.0.0.77")
         held.send(b"GET /a.bin HTTP")
@@ -136,15 +115,14 @@ def test_100_resets_under_load(site):
         held.close()
         if number == 20:
             memory, descriptors_before = resident_kib(server.pid), len(descriptors(server.pid))
-        goal = outcomes["whole"] + 20
-        wait_until(lambda: outcomes["whole"] >= goal or clients.errors, "answers between the resets")
-    stop.append(True)
-    clients.join()
+        goal = clients.outcomes["whole"] + 20
+        wait_until(lambda: clients.outcomes["whole"] >= goal or clients.errors, "answers between the resets")
+    clients.stop()
     server.wait_idle()
     site.get("/hello.htm")
     server.wait_idle()
     print(
-        f"\n100 resets: {outcomes}, RSS {memory} -> {resident_kib(server.pid)} KiB, "
+        f"\n100 resets: {clients.outcomes}, RSS {memory} -> {resident_kib(server.pid)} KiB, "
         f"descriptors {descriptors_before} -> {len(descriptors(server.pid))}"
     )
     assert thread_count(server.pid) == server.threads

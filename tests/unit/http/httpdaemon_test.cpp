@@ -179,6 +179,7 @@ TEST_F(oxHttpDaemonTest, ClientThatLeavesBeforeItIsAcceptedLeavesNoLine) {
 
 TEST_F(oxHttpDaemonTest, AcceptedConnectionsAreCloseOnExec) {
     ASSERT_TRUE(Start());
+    std::atomic<int> guarded{0};
     std::atomic<int> unguarded{0};
     server->onRequest = [&](const oxRequest&) {
         for (int descriptor = 3; descriptor < 200; ++descriptor) {
@@ -186,11 +187,12 @@ TEST_F(oxHttpDaemonTest, AcceptedConnectionsAreCloseOnExec) {
             socklen_t length = sizeof peer;
             if (getpeername(descriptor, reinterpret_cast<sockaddr*>(&peer), &length) == 0 &&
                 ntohs(peer.sin_port) != settings.port)
-                unguarded += (fcntl(descriptor, F_GETFD) & FD_CLOEXEC) == 0;
+                ++((fcntl(descriptor, F_GETFD) & FD_CLOEXEC) != 0 ? guarded : unguarded);
         }
         return std::make_unique<oxResource_Invalid>(Http::NOT_FOUND_404, nullptr);
     };
     EXPECT_NE(Ask(settings.port, "GET / HTTP/1.0\r\n\r\n").find("404"), std::string::npos);
+    EXPECT_EQ(guarded, 1);
     EXPECT_EQ(unguarded, 0);
 }
 

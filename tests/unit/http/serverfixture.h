@@ -83,13 +83,6 @@ protected:
     }
     // Makes the listener sweep, as every new connection does.
     void Poke() const { Ask(settings.port, "GET / HTTP/1.0\r\n\r\n"); }
-    // A session ends a moment after its client has seen the end: pokes until the given sessions are removed.
-    bool PokeUntilRemoved(int sessions) const {
-        return Eventually([&] {
-            Poke();
-            return Count("Removing user session") >= sessions;
-        });
-    }
     // Moves the clock on until a session that is not served in that time is dropped.
     bool AdvanceUntilTimedOut() {
         return Eventually([&] {

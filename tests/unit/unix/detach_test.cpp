@@ -20,6 +20,14 @@ std::string Ids(const char* kind, unsigned real, unsigned effective) {
 }
 }  // namespace
 
+// In a child: puts one open file on the three standard descriptors; its own, above them.
+int ZeroOnStandardStreams() {
+    const int zero = open("/dev/zero", O_RDWR);
+    for (int i = 0; i < 3; ++i)
+        dup2(zero, i);
+    return zero;
+}
+
 TEST(FillStandardDescriptors, OpensOnlyWhatIsClosed) {
     EXPECT_EQ(RunInChild([] {
                   const int marker = open("/dev/zero", O_RDONLY);
@@ -41,9 +49,7 @@ TEST(FillStandardDescriptors, OpensOnlyWhatIsClosed) {
 
 TEST(DropInheritedDescriptors, ClosesAllAboveStandardError) {
     EXPECT_EQ(RunInChild([] {
-                  const int zero = open("/dev/zero", O_RDWR);
-                  for (int i = 0; i < 3; ++i)
-                      dup2(zero, i);
+                  const int zero = ZeroOnStandardStreams();
                   const int far = fcntl(zero, F_DUPFD, 500);
                   const int own = fcntl(zero, F_DUPFD_CLOEXEC, 600);
                   if (zero < 3 || far < 500 || own < 600)
@@ -62,9 +68,7 @@ TEST(DropInheritedDescriptors, ClosesAllAboveStandardError) {
 
 TEST(DropInheritedDescriptors, OrOnlyKeepsThemFromStartedPrograms) {
     EXPECT_EQ(RunInChild([] {
-                  const int zero = open("/dev/zero", O_RDWR);
-                  for (int i = 0; i < 3; ++i)
-                      dup2(zero, i);
+                  const int zero = ZeroOnStandardStreams();
                   const int far = fcntl(zero, F_DUPFD, 500);
                   if (zero < 3 || far < 500 || fcntl(zero, F_GETFD) != 0 || fcntl(far, F_GETFD) != 0)
                       return 1;
@@ -81,9 +85,7 @@ TEST(DropInheritedDescriptors, OrOnlyKeepsThemFromStartedPrograms) {
 
 TEST(SilenceStandardStreams, PointsInputAndOutputAtNothing) {
     EXPECT_EQ(RunInChild([] {
-                  const int zero = open("/dev/zero", O_RDWR);
-                  for (int i = 0; i < 3; ++i)
-                      dup2(zero, i);
+                  const int zero = ZeroOnStandardStreams();
                   close(zero);
                   SilenceStandardStreams();
                   return IsNull(0) && IsNull(1) && !IsNull(2) && open("/dev/null", O_RDONLY) == zero ? 0 : 1;

@@ -15,7 +15,6 @@ import pytest
 
 from harness import (
     SANITIZER,
-    Background,
     Client,
     ResetLoad,
     cpu_seconds,

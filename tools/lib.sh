@@ -5,7 +5,7 @@ TOP=$(cd "$(dirname "${BASH_SOURCE[0]}")/.." && pwd)
 # For the scripts that source this file.
 # shellcheck disable=SC2034
 {
-    BUILD_PACKAGES=(g++ cmake ninja-build libsimpleini-dev)
+    BUILD_PACKAGES=(g++ cmake ninja-build libsimpleini-dev libsodium-dev libpam0g-dev libcrypt-dev)
     TEST_PACKAGES=(libgtest-dev python3 python3-pytest python3-pytest-xdist perl procps strace)
     FUZZ_PACKAGES=(clang libclang-rt-dev llvm)
 }

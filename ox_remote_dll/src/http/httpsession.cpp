@@ -68,6 +68,7 @@ void oxHttpSession::Abort() {
         if (m_state != STATE_FINISHED)
             m_state = STATE_CLOSING;
     }
+    m_stopFlag = true;
     m_socket.Close();
 }
 
@@ -116,6 +117,7 @@ void oxHttpSession::ServeRequest(oxRequest& request) {
         m_resource = m_server.CreateResource(request);
         if (!m_resource)
             throw std::runtime_error("unable to allocate request");
+        m_resource->SetStopFlag(m_stopFlag);
     }
     // A read that ended because the connection was closed under it is neither good nor bad: nobody is left to answer.
     if (!good && request.GetStatus() == oxRequest::STATUS_GOOD)

@@ -74,7 +74,8 @@ private:
     oxSockAddr m_peerAddress;
     std::atomic<bool> m_active{true};
     bool m_stopped = false;
-    MMutex m_mutex;  // guards the changes of the state; never held over a call that may wait
+    std::atomic<bool> m_stopFlag{false};  // what the resource looks at while it waits
+    MMutex m_mutex;                       // guards the changes of the state; never held over a call that may wait
     std::unique_ptr<oxResource> m_resource;
     std::unique_ptr<oxReply> m_reply;
 };

@@ -18,6 +18,7 @@ oxHttpSettings oxHttpSettings::Read(const oxConfig& config, const char* section,
         config.GetInt(section, m_sINI_KEY_MAX_SESSIONS_PER_ADDRESS, DEFAULT_MAX_SESSIONS_PER_ADDRESS);
     settings.logging = config.GetBool(section, m_sINI_KEY_WEB_LOGGING, settings.logging);
     settings.logFileName = config.GetText(section, m_sINI_KEY_LOG_FILE_NAME, m_sDEFAULT_LOG_FILE_NAME);
+    settings.scriptTimeout = std::max(0, config.GetInt(section, m_sINI_KEY_SCRIPT_TIMEOUT, settings.scriptTimeout));
     settings.homeDirectory = homeDirectory;
     settings.documentRoot = documentRoot;
     return settings;

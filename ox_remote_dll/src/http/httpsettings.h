@@ -18,6 +18,7 @@ struct oxHttpSettings {
     static constexpr const char* m_sINI_KEY_LOG_ERROR_FILE = "WebErrorLog";
     static constexpr const char* m_sINI_KEY_MAX_SESSIONS_PER_ADDRESS = "WebMaxConnectionsPerAddress";
     static constexpr const char* m_sINI_KEY_NO_CACHE = "WebNoCache";
+    static constexpr const char* m_sINI_KEY_SCRIPT_TIMEOUT = "WebScriptTimeout";
     static constexpr const char* m_sDEFAULT_LOG_FILE_NAME = "ox_remote.log";
     static constexpr const char* m_sERROR_LOG_NAME = "ox_remote.err";
     static constexpr const char* m_sDEFAULT_WEB_ADDRESS = "";  // every local address
@@ -37,6 +38,7 @@ struct oxHttpSettings {
     std::string logFileName = m_sDEFAULT_LOG_FILE_NAME;
     bool noCache = false;
     int maxSessionsPerAddress = DEFAULT_MAX_SESSIONS_PER_ADDRESS;  // 0 or less: no limit
+    int scriptTimeout = 0;                                         // seconds for one script run; 0: no limit
     std::string homeDirectory;                                     // the access log lies here
     std::string documentRoot;                                      // what browsers see
 

@@ -1,6 +1,7 @@
 // What a request's URL resolves to.
 #pragma once
 
+#include <atomic>
 #include <memory>
 #include <string>
 
@@ -13,6 +14,14 @@ class oxResource {
 public:
     virtual ~oxResource() = default;
     virtual std::unique_ptr<oxReply> GetReply(const oxRequest& request) = 0;
+
+    // The flag that another thread sets when the answer is no longer wanted. A resource that may wait long looks at it
+    // and gives up. It must outlive the resource.
+    void SetStopFlag(const std::atomic<bool>& stop) { m_stop = &stop; }
+
+protected:
+    bool IsStopped() const { return m_stop != nullptr && m_stop->load(); }
+    const std::atomic<bool>* m_stop = nullptr;
 };
 
 // A fixed answer without a file. The status object must outlive the resource.

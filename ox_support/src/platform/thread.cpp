@@ -214,7 +214,14 @@ bool MThread::WaitForRun(const std::optional<std::chrono::milliseconds>& limit) 
 }
 
 void MThread::Cancel() {
+    const std::scoped_lock lock(m_pauseMutex);
     m_cancelled.store(true);
+    m_pauseEnd.Broadcast();
+}
+
+bool MThread::Pause(std::chrono::milliseconds time) {
+    std::unique_lock lock(m_pauseMutex);
+    return !m_pauseEnd.WaitFor(lock, time, [this] { return m_cancelled.load(); });
 }
 
 bool MThread::IsRunning() const {

@@ -72,6 +72,8 @@ public:
     // running function. The next `Create` takes the request back.
     void Cancel();
     bool IsCancelled() const { return m_cancelled.load(); }
+    // Waits, for the body of this thread: true when the time has passed, false at once when the thread is cancelled.
+    bool Pause(std::chrono::milliseconds time);
     bool IsRunning() const;
 
     // The kernel's id of the started thread (0 before the first start); in log lines with 0x%X.
@@ -95,6 +97,8 @@ private:
 
     const Priority m_priority;
     const Kept m_kept;
+    MMutex m_pauseMutex;
+    MCondVar m_pauseEnd;
     mutable MMutex m_mutex;  // over the two below
     std::shared_ptr<Run> m_run;
     MThreadError m_error;

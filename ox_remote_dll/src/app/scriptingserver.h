@@ -1,0 +1,38 @@
+// The link between script resources and the application's commands.
+#pragma once
+
+#include <cstddef>
+#include <memory>
+#include <string>
+
+#include "http/authenticatedserver.h"
+#include "resources/script.h"
+
+// Carries out one command of a script: the context string, the command code, the decoded argument text, and the buffer
+// for the reply with its size. The result is the status that the script gets.
+using oxApplicationCallback = int (*)(const char* contextString, int command, const char* argumentText, char* reply,
+                                      std::size_t replySize);
+
+class oxScriptingHttpServer : public oxAuthenticatedHttpServer {
+public:
+    static constexpr std::size_t REPLY_BUFFER = 65536;
+    static constexpr std::size_t REPLY_SIZE = 65535;  // what the application is told
+
+    oxScriptingHttpServer();
+    // A later construction replaces the callback of an earlier one.
+    explicit oxScriptingHttpServer(oxApplicationCallback callback, const oxClock& clock = oxClock::System());
+    ~oxScriptingHttpServer() override;
+
+    std::unique_ptr<oxResource_Script> CreateScript(const std::string& homeDirectory, const std::string& scriptFile,
+                                                    const std::string& includeDirectory, const std::string& parameters);
+
+    // What the engine's commands reach. The text that is returned belongs to the calling thread and is good until its
+    // next command.
+    static const char* ScriptCallback(void* context, const char* contextString, int command, char* argumentText,
+                                      int* status);
+    // The argument text of the command that the calling thread serves, as it came, before decoding.
+    static const std::string& RawArguments();
+
+private:
+    static oxApplicationCallback m_pScriptCallBack;
+};

@@ -1,0 +1,11 @@
+// The escaping of call-back arguments.
+#pragma once
+
+#include <string>
+#include <string_view>
+
+// "+" becomes a blank and "%XX" the byte, in one pass; a "%" without two hexadecimal digits stays. A decoded NUL ends
+// the text.
+std::string DecodeUrlText(std::string_view text);
+// The same in a C string's own buffer.
+void DecodeUrlText(char* text);

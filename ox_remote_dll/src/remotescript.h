@@ -1,0 +1,73 @@
+// One run of a script in the scripting engine, and the service of the engine's call-backs while it runs.
+#pragma once
+
+#include <atomic>
+#include <chrono>
+#include <cstddef>
+#include <cstdint>
+#include <optional>
+#include <string>
+#include <string_view>
+
+#include "proc.h"
+#include "rwlock.h"
+
+// Serves one command of the engine: the context that the run was given, the message's first string, the command, the
+// message's second string (may be changed in place) and the status to answer (0 at the call). Never returns null; the
+// text is copied before the next call of the same thread.
+using oxScriptCallback = const char* (*)(void* context, const char* contextString, int command, char* argumentText,
+                                         int* status);
+
+// What ends a run before its time. The engine is then interrupted, and killed after END_GRACE.
+struct oxScriptLimits {
+    const std::atomic<bool>* stop = nullptr;  // set by another thread; looked at at least once in STOP_TICK
+    std::chrono::seconds time{0};             // for the whole run; 0: no limit
+};
+
+// Thread rules: an object belongs to one thread; the lock that scripts take with commands 60 and 61 is shared by all.
+class oxRemoteScript {
+public:
+    enum LockState : std::uint32_t { rwUnlocked = 0, rwReading = 1, rwWriting = 2 };
+    static constexpr const char* m_sENGINE_NAME = "ox_script.bin";
+    static constexpr const char* m_sPipeNamePrefix = "./.oxscriptcallback:";  // kept; the pipes have no names
+    static constexpr std::size_t MAX_ENGINE_PATH = 4094;
+    static constexpr std::size_t MAX_DIRECTORY = 4096;
+    static constexpr std::size_t MAX_MESSAGE = 4096;  // bytes of one message of the engine
+    static constexpr std::size_t MIN_MESSAGE = 9;     // shorter ones are not answered
+    static constexpr std::uint32_t END_WAIT = 10000;  // milliseconds for the engine to end by itself after its run
+    static constexpr std::chrono::milliseconds END_GRACE{5000};  // between the interrupt and the kill
+    static constexpr std::chrono::milliseconds STOP_TICK{250};
+    static constexpr int COMMAND_READ_LOCK = 60;
+    static constexpr int COMMAND_WRITE_LOCK = 61;
+    static constexpr int RESULT_NOT_SPAWNED = -1;
+    static constexpr int RESULT_ENDED = -1;  // stopped, or past the time limit
+
+    oxRemoteScript();
+    // The engine is directory + "/ox_script.bin".
+    explicit oxRemoteScript(const char* directory);
+    ~oxRemoteScript();
+    oxRemoteScript(const oxRemoteScript&) = delete;
+    oxRemoteScript& operator=(const oxRemoteScript&) = delete;
+
+    void SetLimits(const oxScriptLimits& limits) { m_limits = limits; }
+
+    // Runs the engine once with the arguments (a null or empty one becomes "NULL") and the data on its standard input,
+    // and serves its messages until it says EXIT, closes its end or ends. 0 is success (also when no pipe could be
+    // made); else the engine's exit code or signal number, or one of the results above.
+    int Run(int argc, char** argv, void* context, oxScriptCallback callback, std::string_view data);
+    // Serves one message and writes the answer to the descriptor. A message that breaks the bounds is not answered.
+    void PerformCallback(int fd, char* message, int length, oxScriptCallback callback);
+
+    const char* EnginePath() const { return m_enginePath; }
+    LockState GetLockState() const { return m_locked; }
+
+private:
+    char m_enginePath[MAX_ENGINE_PATH + 1] = {};
+    char m_directory[MAX_DIRECTORY + 1] = {};
+    LockState m_locked = rwUnlocked;
+    oxScriptLimits m_limits;
+    void* m_context = nullptr;
+
+    static std::atomic<std::uint32_t> m_dwPipeID;
+    static RWLock& m_rwLock;  // never destroyed
+};

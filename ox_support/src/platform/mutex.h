@@ -23,6 +23,9 @@ public:
     // Gives up after the time; for handlers that must not hang on a lock that their own thread may hold.
     bool try_lock_for(std::chrono::milliseconds limit);
 
+    // For code that a cancelled thread may leave in the middle, where no guard object may stand.
+    pthread_mutex_t* Native() { return &m_mutex; }
+
 private:
     friend class MCondVar;
     pthread_mutex_t m_mutex = PTHREAD_MUTEX_INITIALIZER;
@@ -61,6 +64,8 @@ public:
         }
         return true;
     }
+
+    pthread_cond_t* Native() { return &m_cond; }  // as the mutex's; its timed waits are on CLOCK_MONOTONIC
 
 private:
     pthread_cond_t m_cond;

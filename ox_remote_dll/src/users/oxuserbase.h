@@ -4,18 +4,25 @@
 #include <atomic>
 #include <cstddef>
 #include <cstdint>
+#include <functional>
 #include <map>
+#include <memory>
 #include <string>
 
 #include "platform/mutex.h"
 #include "users/userbase.h"
+#include "users/userdirectory.h"
+#include "users/userfile.h"
 
 // The files `*.usr` of one directory, loaded into memory. Every changing operation reloads the files first (those that
 // did not change are not read again), changes one user and writes that user's file, so edits by hand and by other
 // processes are kept. `Authenticate` does not reload: an edit by hand counts from the next change or start on.
 //
 // Files: mode 0600, in a directory of mode 0700; a change is written beside, flushed to disk and renamed, so a file is
-// whole at any moment. Keys and sections that mean nothing here are kept.
+// whole at any moment. Keys and sections that mean nothing here are kept. Of several files with one user name the first
+// counts, in the order of the file names; deleting the user removes them all.
+//
+// Several processes may change users of one directory: a change waits while another process makes one.
 //
 // Errors: a change whose file cannot be written is refused and changes nothing in memory; a directory that cannot be
 // listed keeps the users that were loaded; a user whose password cannot be deciphered is not taken, with a line on
@@ -43,7 +50,8 @@ public:
     explicit oxUserBase(const std::string& directory);
     ~oxUserBase() override;
 
-    // Names another directory and loads it. The answer of LoadAll.
+    // Names a directory and loads it; with another one than before, the users of that one are gone in any case. The
+    // answer of LoadAll.
     bool Open(const std::string& directory);
 
     bool Authenticate(const std::string& name, const std::string& password, std::uint32_t* permissions) override;
@@ -57,8 +65,10 @@ public:
     bool GetPermissionsText(const std::string& name, char* buffer, std::size_t size) override;
     virtual bool AllowsAnonymousUser();  // asked by AddUser before it would treat "anonymous" specially; always true
 
-    // False when the directory is missing or cannot be listed; the users stay as they were.
+    // False when the directory is missing or cannot be listed; the users stay as they were. Also removes what a crash
+    // in the middle of a change left in the directory.
     bool LoadAll();
+    // Writes the user's file as it is in memory.
     bool SaveUser(const std::string& name);
     // "u1=alice&p1=3&u2=bob&p2=1" in the order of the names, as long as more than LIST_ROOM bytes are left.
     void ListUsers(char* buffer, std::size_t size);
@@ -67,11 +77,39 @@ public:
     // Grows with every change of a user that this object saw; remembered logins of an older number are checked again.
     std::uint64_t Generation() const { return m_generation.load(); }
 
+    // How often a user file was read and deciphered; files that did not change are not.
+    std::uint64_t FilesRead() const { return m_filesRead.load(); }
+
 private:
-    struct Entry;  // MAX_ limits above
-    std::string m_directory;
-    std::map<std::string, Entry> m_users;
+    // One user file, as last read or written.
+    struct File {
+        std::string name;
+        oxUserFile::Content content;
+        oxFileStamp stamp;
+        bool readAgain = true;  // at the next reload, whatever the stamp says then
+
+        bool IsUser() const { return content.state == oxUserFile::State::User; }
+    };
+    using FilePointer = std::shared_ptr<const File>;
+    using Files = std::map<std::string, FilePointer>;  // by file name
+    using Users = std::map<std::string, std::string>;  // from user name to the file that counts
+
+    // Want the mutex to be held.
+    bool Load();
+    int Reload();  // 0 or an errno value
+    FilePointer Look(const std::string& fileName, const FilePointer& known);
+    void EncipherPlaintexts();
+    bool IsSame(const Users& users, const Files& files) const;
+    FilePointer* Find(const std::string& name);
+    bool Store(const File& file);
+
+    bool Change(const std::string& name, const std::function<void(oxUserRecord&)>& change);
+
+    oxUserDirectory m_directory;
+    Files m_files;
+    Users m_users;
     MMutex m_mutex;
-    std::int32_t m_reserved = -1;  // kept; nothing reads it
+    [[maybe_unused]] std::int32_t m_reserved = -1;  // kept; nothing reads it
     std::atomic<std::uint64_t> m_generation{1};
+    std::atomic<std::uint64_t> m_filesRead{0};
 };

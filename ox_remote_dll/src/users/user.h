@@ -14,8 +14,8 @@ public:
     // The idle time-out of all users, in seconds; set when the server is configured.
     static std::atomic<std::int32_t> m_nTimeout;
 
-    explicit oxUser(const oxClock& clock = oxClock::System());
-    ~oxUser() override;  // wipes the password
+    explicit oxUser(const oxClock& clock = oxClock::System());  // in use from now on
+    ~oxUser() override;                                         // wipes the password
 
     virtual void SetPermissions(std::uint32_t permissions);  // counts as use
     virtual std::uint32_t GetPermissions();                  // counts as use
@@ -27,7 +27,7 @@ public:
 
 private:
     const oxClock& m_clock;
-    std::int32_t m_lastAccess = 0;  // seconds since the epoch
+    std::int64_t m_lastAccess;  // seconds since the epoch
     std::uint32_t m_permissions = 0;
     std::uint32_t m_attribute = 0;
 };

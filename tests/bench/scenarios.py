@@ -1,5 +1,7 @@
 """What is asked of the servers. A new scenario is one more entry of SCENARIOS."""
 
+import base64
+import hashlib
 from collections.abc import Callable
 from dataclasses import dataclass, field
 from pathlib import Path
@@ -17,7 +19,8 @@ class Scenario:
     prepare: Callable[["Scenario", Path], None]  # fills the web root that all servers share
     stretch: int = 1  # times the seconds of a cell: slow replies need longer runs for the same number of requests
     ab_options: list[str] = field(default_factory=list)  # say, ["-A", "user:password"]
-    # Lines added to a server's configuration, by the server's name; see Server.configure for where they go.
+    # Lines added to a server's configuration, by the server's name; see Server.configure for where they go. @ROOT@ is
+    # the web root.
     extra_config: dict[str, str] = field(default_factory=dict)
     only: frozenset[str] | None = None  # the servers that can answer it; None: all
 
@@ -35,8 +38,64 @@ def page(scenario: Scenario, root: Path) -> None:
     (root / scenario.path.lstrip("/")).write_bytes(head + body + tail)
 
 
+USER, PASSWORD = "bench", "mark"
+
+# What all servers run: the headers are for those that hand a script's output on as it is.
+HELLO = """\
+use strict;
+print "Content-Type: text/html\\r\\n\\r\\n" if $ENV{GATEWAY_INTERFACE};
+print "<html><body>Hello, world: 0123456789</body></html>\\n";
+"""
+HELLO_SIZE = 51
+# The smallest scripting engine that can run it: the page goes to the file that the server names.
+ENGINE = """\
+#!/usr/bin/perl
+my ($script, $page) = @ARGV[1, 3];
+open my $server, '>&', \\*STDOUT or die $!;
+open STDOUT, '>>', $page or die $!;
+do $script;
+close STDOUT;
+syswrite $server, "EXIT";
+"""
+
+
+def script(scenario: Scenario, root: Path) -> None:
+    for path, text in ((root / scenario.path.lstrip("/"), f"#!/usr/bin/perl\n{HELLO}"),
+                       (root.parent / "ox_script.bin", ENGINE)):
+        path.write_text(text)
+        path.chmod(0o755)
+
+
+def page_behind_login(scenario: Scenario, root: Path) -> None:
+    """The page in a directory of its own, and the one user in every server's form: a hash that costs them little."""
+    (root / scenario.path.lstrip("/")).parent.mkdir()
+    page(scenario, root)
+    digest = base64.b64encode(hashlib.sha1(PASSWORD.encode()).digest()).decode()
+    (root.parent / "htpasswd").write_text(f"{USER}:{{SHA}}{digest}\n")
+    users = root.parent / "oxm_oxx" / "datfiles" / "users"
+    users.mkdir(parents=True)
+    (users / f"{USER}.usr").write_text(f"[UserInfo]\nusername={USER}\nPlaintextPassword={PASSWORD}\npermissions=0\n")
+
+
 SCENARIOS = [
     Scenario("1k", "1 KB file", "/1k.html", 1 * KB, page),
     Scenario("100k", "100 KB file", "/100k.html", 100 * KB, page),
     Scenario("10m", "10 MB file", "/10m.html", 10 * MB, page, stretch=2),
+    Scenario("script", "hello-world Perl script", "/hello.pl", HELLO_SIZE, script, only=frozenset(
+        {"ox_remote", "lighttpd", "apache"}), extra_config={
+            "lighttpd": 'server.modules += ( "mod_cgi" )\ncgi.assign = ( ".pl" => "/usr/bin/perl" )\n'
+                        'static-file.exclude-extensions = ( ".pl" )',
+            "apache": "LoadModule cgid_module /usr/lib/apache2/modules/mod_cgid.so\nScriptSock cgisock\n"
+                      "AddHandler cgi-script .pl\n<Directory @ROOT@>\nOptions +ExecCGI\n</Directory>"}),
+    Scenario("login", "1 KB file behind a login", "/private/1k.html", 1 * KB, page_behind_login,
+             ab_options=["-A", f"{USER}:{PASSWORD}"], extra_config={
+                 "nginx": "location /private/ { auth_basic private; auth_basic_user_file @ROOT@/../htpasswd; }",
+                 "lighttpd": 'server.modules += ( "mod_auth", "mod_authn_file" )\n'
+                             'auth.backend = "htpasswd"\nauth.backend.htpasswd.userfile = "@ROOT@/../htpasswd"\n'
+                             'auth.require = ( "/private/" => ( "method" => "basic", "realm" => "private", '
+                             '"require" => "valid-user" ) )',
+                 "apache": "".join(f"LoadModule {name}_module /usr/lib/apache2/modules/mod_{name}.so\n" for name in
+                                   ("auth_basic", "authn_core", "authn_file", "authz_user")) +
+                           "<Directory @ROOT@/private>\nAuthType Basic\nAuthName private\n"
+                           "AuthUserFile @ROOT@/../htpasswd\nRequire valid-user\n</Directory>"}),
 ]

@@ -56,7 +56,7 @@ class Server:
 
     def start(self, extra: str = "") -> None:
         self.folder.mkdir(parents=True, exist_ok=True)
-        command = self.configure(extra)
+        command = self.configure(extra.replace("@ROOT@", str(self.root)))
         with open(self.folder / "output", "wb") as output:
             self._process = subprocess.Popen(command, cwd=self.folder, stdin=subprocess.DEVNULL, stdout=output,
                                              stderr=subprocess.STDOUT, start_new_session=True)

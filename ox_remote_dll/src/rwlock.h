@@ -1,6 +1,7 @@
 // The reader/writer lock of the scripts.
 #pragma once
 
+#include <chrono>
 #include <cstdint>
 #include <functional>
 
@@ -33,6 +34,7 @@ public:
 
     // Like ReadLock and WriteLock, but ask now and then (every GIVE_UP_INTERVAL) whether to give up the wait; then the
     // result is ECANCELED and nothing is held. The function is called with the lock's mutex held and must not use it.
+    // An exception that it throws leaves the wait as a cancellation does.
     static constexpr std::chrono::milliseconds GIVE_UP_INTERVAL{100};
     int ReadLock(const std::function<bool()>& giveUp);
     int WriteLock(const std::function<bool()>& giveUp);
@@ -40,12 +42,25 @@ public:
     int WaitingReaders();
     int WaitingWriters();
 
+    // What a waiting thread that is cancelled runs, with the mutex held.
     static void ReadCleanup(void* lock);
     static void WriteCleanup(void* lock);
 
 private:
+    using GiveUp = std::function<bool()>;
+    int Read(const GiveUp* giveUp);
+    int Write(const GiveUp* giveUp);
+    void Enter(const char* function);
+    int Leave(int status, const char* function);
+    [[noreturn]] void Fail(int status, const void* primitive, const char* function);
+    void CheckValid(const char* function) const;
+    int WaitOn(MCondVar& condition, const GiveUp* giveUp, const char* function);
+    void WaitSliceOn(MCondVar& condition, const char* function);
+    int WakeDestructor();
+    int LeftWithoutLock();
+
     std::int32_t m_status = 0;                       // result of the last operation of any thread
-    const void* m_error = nullptr;                   // the primitive that failed last
+    const void* m_error = nullptr;                   // the primitive that failed last, for a core file
     volatile std::uint32_t m_bValid = RWLOCK_VALID;  // volatile: else the destructor's last store is optimised away
     MMutex m_mutex;
     MCondVar m_readOK;
@@ -54,5 +69,5 @@ private:
     int m_readers = 0;
     int m_readersWaiting = 0;
     int m_writersWaiting = 0;
-    bool m_destroying = false;
+    bool m_destroying = false;  // the destructor waits: it has to be woken too
 };

@@ -7,6 +7,7 @@
 #include <limits>
 
 #include "platform/text.h"
+#include "proc.h"
 #include "support/auditfile.h"
 
 namespace {
@@ -28,6 +29,9 @@ int oxLimitCalls::Set(const rlimit& limit) {
 uid_t oxLimitCalls::EffectiveUser() {
     return geteuid();
 }
+void oxLimitCalls::KeepForChildren(const rlimit& limit) {
+    oxProc::SetChildFileLimit(limit);
+}
 
 void RaiseFileLimit(int wanted, oxAuditFile& audit, oxLimitCalls& calls) {
     rlimit limit{};
@@ -35,6 +39,7 @@ void RaiseFileLimit(int wanted, oxAuditFile& audit, oxLimitCalls& calls) {
         audit.Printf(5, "getrlimit: %s", GetLastErrorText(errno));
         return;
     }
+    calls.KeepForChildren(limit);
     const int hard = AsInt(limit.rlim_max);
     if (wanted == NOT_CONFIGURED)
         wanted = hard;

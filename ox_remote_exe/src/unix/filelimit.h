@@ -13,6 +13,8 @@ public:
     virtual int Get(rlimit& limit);
     virtual int Set(const rlimit& limit);
     virtual uid_t EffectiveUser();
+    // Keeps the limit as it was found: children get it back, who may count on small descriptor numbers.
+    virtual void KeepForChildren(const rlimit& limit);
 };
 
 // Raises the limit to the wanted number; -1 wants the hard limit. A limit that is high enough already is left alone,

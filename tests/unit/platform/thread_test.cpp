@@ -316,6 +316,62 @@ TEST(MThread, CancelAsksAndCreateTakesTheRequestBack) {
     }
 }
 
+namespace {
+// A body that pauses once and says how the pause ended.
+struct Pausing {
+    static void* Body(void* argument) {
+        auto* const self = static_cast<Pausing*>(argument);
+        const auto start = std::chrono::steady_clock::now();
+        self->inPause = true;
+        self->passed = self->thread.Pause(self->time);
+        self->took = std::chrono::steady_clock::now() - start;
+        return nullptr;
+    }
+    explicit Pausing(milliseconds pause) : time(pause) {}
+
+    const milliseconds time;
+    MThread thread;
+    std::atomic<bool> inPause{false};
+    bool passed = false;
+    std::chrono::steady_clock::duration took{};
+};
+}  // namespace
+
+TEST(MThread, APauseLastsItsTime) {
+    for (const milliseconds time : {milliseconds(-1), milliseconds(0), milliseconds(30)}) {
+        Pausing pausing(time);
+        ASSERT_TRUE(pausing.thread.Create(&Pausing::Body, &pausing));
+        EXPECT_TRUE(pausing.thread.Wait());
+        EXPECT_TRUE(pausing.passed);
+        EXPECT_GE(pausing.took, time);
+    }
+}
+
+TEST(MThread, CancelEndsAPauseAtOnce) {
+    constexpr int ROUNDS = 50;
+    for (int round = 0; round < ROUNDS; ++round) {
+        Pausing pausing(LONG);
+        ASSERT_TRUE(pausing.thread.Create(&Pausing::Body, &pausing));
+        // Some are cancelled before the pause begins.
+        if (round % 2 == 0) {
+            ASSERT_TRUE(Eventually([&] { return pausing.inPause.load(); }));
+        }
+        pausing.thread.Cancel();
+        ASSERT_TRUE(pausing.thread.Wait(LONG / 2)) << "no wake-up is lost";
+        EXPECT_FALSE(pausing.passed);
+    }
+}
+
+TEST(MThread, PausesOfACancelledThreadAreOverUntilItIsCreatedAgain) {
+    Pausing pausing(milliseconds(1));
+    pausing.thread.Cancel();
+    EXPECT_FALSE(pausing.thread.Pause(LONG));
+    EXPECT_FALSE(pausing.thread.Pause(milliseconds(0)));
+    ASSERT_TRUE(pausing.thread.Create(&Pausing::Body, &pausing));
+    EXPECT_TRUE(pausing.thread.Wait());
+    EXPECT_TRUE(pausing.passed);
+}
+
 TEST(MThread, StartsWithTheCallersSignalMask) {
     sigset_t blocked;
     sigset_t before;

@@ -3,7 +3,10 @@
 #include <gtest/gtest.h>
 
 #include <cerrno>
+#include <string>
+#include <vector>
 
+#include "proc.h"
 #include "unix/testtools.h"
 
 namespace {
@@ -28,8 +31,10 @@ public:
         return 0;
     }
     uid_t EffectiveUser() override { return user; }
+    void KeepForChildren(const rlimit& limit) override { kept.push_back(limit); }
 
     rlimit now{};
+    std::vector<rlimit> kept;
     uid_t user = USER;
     int setError = 0;
     int sets = 0;
@@ -93,6 +98,9 @@ TEST(RaiseFileLimit, FollowsTheWantedNumber) {
         EXPECT_EQ(fake.now.rlim_cur, row.newSoft);
         EXPECT_EQ(fake.now.rlim_max, row.newHard);
         EXPECT_EQ(fake.sets, row.sets);
+        ASSERT_EQ(fake.kept.size(), 1U);
+        EXPECT_EQ(fake.kept[0].rlim_cur, row.soft) << "as it was found";
+        EXPECT_EQ(fake.kept[0].rlim_max, row.hard);
         EXPECT_EQ(audit.lines, row.lines);
     }
 }
@@ -107,6 +115,38 @@ TEST(RaiseFileLimit, RaisesTheRealLimit) {
                   RaiseFileLimit(50, audit);
                   getrlimit(RLIMIT_NOFILE, &limit);
                   return limit.rlim_cur == 50 && limit.rlim_max == 50 ? 0 : 1;
+              }),
+              0);
+}
+
+TEST(RaiseFileLimit, ALimitThatCannotBeReadIsToldAndNotKept) {
+    class Unreadable : public FakeLimit {
+        int Get(rlimit&) override {
+            errno = EPERM;
+            return -1;
+        }
+    } fake;
+    LinesAudit audit;
+    RaiseFileLimit(2000, audit, fake);
+    EXPECT_EQ(audit.lines, std::vector<std::string>{"5|getrlimit: Operation not permitted"});
+    EXPECT_TRUE(fake.kept.empty());
+    EXPECT_EQ(fake.sets, 0);
+}
+
+TEST(RaiseFileLimit, ChildrenGetTheLimitThatWasFound) {
+    EXPECT_EQ(RunInChild([] {
+                  rlimit limit{};
+                  getrlimit(RLIMIT_NOFILE, &limit);
+                  limit.rlim_cur = 40;
+                  setrlimit(RLIMIT_NOFILE, &limit);
+                  LinesAudit audit;
+                  RaiseFileLimit(-1, audit);
+                  getrlimit(RLIMIT_NOFILE, &limit);
+                  if (limit.rlim_cur <= 40)
+                      return 1;
+                  oxProc proc;
+                  proc.Spawn("/bin/sh", "-c test\t$(ulimit\t-n)\t=\t40");
+                  return proc.Wait(oxProc::NO_LIMIT) == 0 ? 0 : 2;
               }),
               0);
 }

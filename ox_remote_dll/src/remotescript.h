@@ -5,12 +5,12 @@
 #include <chrono>
 #include <cstddef>
 #include <cstdint>
-#include <optional>
 #include <string>
 #include <string_view>
 
-#include "proc.h"
 #include "rwlock.h"
+
+class oxEngineRun;
 
 // Serves one command of the engine: the context that the run was given, the message's first string, the command, the
 // message's second string (may be changed in place) and the status to answer (0 at the call). Never returns null; the
@@ -57,16 +57,32 @@ public:
     int Run(int argc, char** argv, void* context, oxScriptCallback callback, std::string_view data);
     // Serves one message and writes the answer to the descriptor. A message that breaks the bounds is not answered.
     void PerformCallback(int fd, char* message, int length, oxScriptCallback callback);
+    // Serve the commands 60 and 61: the text to answer, and the status -1 when the lock is not to be had. The arguments
+    // begin with the operation's digit; anything else is a programming error of the script and ends the process.
+    const char* ServeReadLock(const char* pszArgs, int* status);
+    const char* ServeWriteLock(const char* pszArgs, int* status);
 
     const char* EnginePath() const { return m_enginePath; }
     LockState GetLockState() const { return m_locked; }
 
 private:
+    // What a script asks of the lock.
+    enum LockOperation : long { UNLOCK = 0, LOCK = 1, TRY_LOCK = 2 };
+
+    std::string Answer(const char* message, int length, oxScriptCallback callback);
+    const char* Dispatch(int command, char* first, char* second, int* status, oxScriptCallback callback);
+    bool IsOver() const;
+    void ReleaseLocks();
+
     char m_enginePath[MAX_ENGINE_PATH + 1] = {};
     char m_directory[MAX_DIRECTORY + 1] = {};
     LockState m_locked = rwUnlocked;
     oxScriptLimits m_limits;
     void* m_context = nullptr;
+    oxEngineRun* m_run = nullptr;  // while Run works
+    // What this run holds of the lock; the lock state tells only what its last command did.
+    int m_reads = 0;
+    bool m_writing = false;
 
     static std::atomic<std::uint32_t> m_dwPipeID;
     static RWLock& m_rwLock;  // never destroyed

@@ -5,6 +5,7 @@
 #include <cstdint>
 #include <string>
 
+#include "platform/file.h"
 #include "platform/mutex.h"
 #include "remotescript.h"
 #include "resources/resource.h"
@@ -32,9 +33,12 @@ public:
 
     const std::string& OutputFile() const { return m_outputFile; }  // empty before GetReply
     const std::string& Script() const { return m_script; }
+    const std::string& Parameters() const { return m_fourth; }
     std::uint32_t PipeID() const { return m_pipeID; }
 
 private:
+    const oxHttpStatus& RunEngine(const std::string& argumentText, UniqueFd& output);
+
     oxScriptCallback m_callback;
     std::string m_outputFile;
     std::string m_directory;

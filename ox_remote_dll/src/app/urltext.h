@@ -8,4 +8,6 @@
 // the text.
 std::string DecodeUrlText(std::string_view text);
 // The same in a C string's own buffer.
-void DecodeUrlText(char* text);
+void DecodeUrlTextInPlace(char* text);
+// The same, but a decoded NUL is a byte like any other, for callers that must see it.
+std::string DecodeUrlBytes(std::string_view text);

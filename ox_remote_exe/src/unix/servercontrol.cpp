@@ -8,15 +8,18 @@
 #include "unix/theserver.h"
 
 int oxTheServerControl::Start(const oxServerArguments& arguments) {
-    oxHttpServer& server = theServer();
+    oxxHttpServer& server = theServer();
     oxConfig config;
     if (!config.Open(arguments.settingsFile)) {
         m_audit.Printf("Error: can't read %s: %s", arguments.settingsFile.c_str(), config.ErrorText().c_str());
         return START_ERROR;
     }
-    server.Configure(oxHttpSettings::Read(config, arguments.section.c_str(), arguments.baseDirectory,
-                                          arguments.documentRoot, static_cast<std::uint32_t>(arguments.defaultPort)));
-    if (server.Start())
+    const char* const section = arguments.section.c_str();
+    server.SetUp(config, section,
+                 oxHttpSettings::Read(config, section, arguments.baseDirectory, arguments.documentRoot,
+                                      static_cast<std::uint32_t>(arguments.defaultPort)),
+                 arguments.ersAddress);
+    if (server.StartAuthenticated(server.Setup()->osAuthentication))
         return START_GOOD;
     return server.GetState() != oxHttpServer::STATE_STOPPED ? START_ERROR : START_FAILED;
 }

@@ -8,12 +8,12 @@
 
 namespace {
 std::once_flag built;
-std::unique_ptr<oxHttpServer> server;
+std::unique_ptr<oxxHttpServer> server;
 }  // namespace
 
-oxHttpServer& theServer() {
+oxxHttpServer& theServer() {
     MThread::Once(built, [] {
-        server = std::make_unique<oxHttpServer>();
+        server = std::make_unique<oxxHttpServer>();
         std::atexit([] { server.reset(); });
     });
     return *server;

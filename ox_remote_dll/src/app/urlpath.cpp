@@ -1,0 +1,44 @@
+#include "app/urlpath.h"
+
+#include <algorithm>
+
+namespace {
+constexpr std::string_view CLIMB = "../";
+constexpr unsigned char BLANK = ' ';
+constexpr unsigned char DELETE = 0x7f;
+}  // namespace
+
+bool oxUrlPath::Climbs() const {
+    return m_path.find(CLIMB) != std::string_view::npos;
+}
+
+bool oxUrlPath::BeginsWith(std::string_view component) const {
+    if (!m_path.starts_with('/') || !m_path.substr(1).starts_with(component))
+        return false;
+    const std::size_t end = 1 + component.size();
+    return end == m_path.size() || m_path[end] == '/';
+}
+
+bool oxUrlPath::IsBelowTop() const {
+    return std::count(m_path.begin(), m_path.end(), '/') > 1;
+}
+
+std::string oxUrlPath::Profile() const {
+    const std::string_view rest = BehindFirst();
+    if (rest.empty())
+        return {};
+    return std::string(rest.substr(1, rest.find('/', 1) - 1));
+}
+
+std::string_view oxUrlPath::BehindFirst() const {
+    const std::size_t first = m_path.find('/');
+    const std::size_t second = first == std::string_view::npos ? first : m_path.find('/', first + 1);
+    return second == std::string_view::npos ? std::string_view() : m_path.substr(second);
+}
+
+bool oxUrlPath::FitsCommandLine() const {
+    return std::none_of(m_path.begin(), m_path.end(), [](char c) {
+        const auto byte = static_cast<unsigned char>(c);
+        return byte <= BLANK || byte == DELETE;
+    });
+}

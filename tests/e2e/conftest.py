@@ -4,6 +4,7 @@ import os
 
 import pytest
 
+import accounts
 import harness
 
 
@@ -68,6 +69,26 @@ def make_site(request):
 @pytest.fixture
 def site(make_site):
     return make_site()
+
+
+@pytest.fixture(params=["root", "lowered", "ordinary"])
+def any_site(request, site):
+    """An installation of root, one of root that lowers itself to another user, and one of an ordinary user. Each owns
+    its files."""
+    if request.param != "ordinary" and not harness.IS_ROOT:
+        pytest.skip("needs root")
+    if request.param == "lowered":
+        site.configure(unix={"uid": 1, "gid": 1})
+        site.give_to(1)
+    elif request.param == "ordinary":
+        site.use_ordinary_user()
+    return site
+
+
+@pytest.fixture
+def machine(site):
+    """An installation that asks the operating system, with accounts of its own."""
+    return accounts.Machine(site)
 
 
 @pytest.fixture

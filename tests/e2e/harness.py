@@ -4,6 +4,7 @@ Only the standard library is used. Nothing here waits for a fixed time where it 
 wait has a deadline that grows with the kind of build under test (a sanitizer makes the server several times slower).
 """
 
+import base64
 import calendar
 import contextlib
 import os
@@ -50,7 +51,30 @@ B413 = (
     b"<html><HEAD><TITLE>413 Server Error</TITLE></HEAD>\r\n<BODY><H2>413 Request Entity Too Large</H2>"
     b"The server was unable to process your request.<P></body></html>"
 )
+B401 = (
+    b"<html><HEAD><TITLE>401 Unauthorized</TITLE></HEAD><BODY><H1>401 Unauthorized</H1>\r\n"
+    b"Authentication required.<P></body></html>"
+)
+B403 = (
+    b"<html><HEAD><TITLE>403 Forbidden</TITLE></HEAD>\r\n<BODY><H1>403 Forbidden</H1>\r\n"
+    b"Access to the requested URL is restricted.<P></body></html>"
+)
+LOCKOUT_PAGE = (
+    b'<html><head><meta HTTP-EQUIV="Expires" content="0"><meta HTTP-EQUIV="Pragma"  content="no-cache">'
+    b'<LINK REL=STYLESHEET HREF="/orvx.css" TYPE="text/css"><title>Access Denied: Orvex Reporting Server</title></head>'
+    b"<body class=standard><br><h1>Orvex Reporting Server &#153;</h1><table border=0><tr><td><font size=-1>"
+    b"This account has been locked for one minute because multiple failed attempts to login were attempted! "
+    b"</font></td></tr><tr><td><font size=-1>After a one minute time out, this account will be unlocked and you will be "
+    b"able to access it again.</font></td></tr></table></body></html>"
+)
 REPLY_400 = b"HTTP/1.0 400 Bad Request\r\nContent-Length: 133\r\n\r\n" + B400
+REPLY_401 = (
+    b"HTTP/1.0 401 Unauthorized\r\n"
+    b'WWW-Authenticate: Basic realm="Orvex Reporting Server\r\n'  # no quote behind the realm
+    b"Content-Length: 124\r\n\r\n" + B401
+)
+REPLY_403 = b"HTTP/1.0 403 Forbidden\r\nContent-Length: 138\r\n\r\n" + B403
+REPLY_LOCKED_OUT = b"HTTP/1.0 403 Forbidden\r\nContent-Length: 590\r\n\r\n" + LOCKOUT_PAGE
 REPLY_404 = b"HTTP/1.0 404 Not Found\r\nContent-Length: 140\r\n\r\n" + B404
 REPLY_413 = b"HTTP/1.0 413 Request Entity Too Large\r\nContent-Length: 158\r\n\r\n" + B413
 
@@ -223,6 +247,12 @@ ORDINARY_LINES = {
         (1, r"Starting server: connecting to \S.* on port \d+\."),
         (3, r"Logging server activity to \S+\."),
         (3, r"Server log closed\."),
+        (3, r"User database directory: \S+\."),
+        (3, r"Log analysis configuration file: \S+\."),
+        (3, r"Profile configuration file: \S*\."),
+        (3, r"Script \[\S+\] requested on session thread 0x[0-9A-F]+\."),
+        (3, r"Authenticating user .+\.\.\."),
+        (2, r"User .+ [Aa]uthenticated\.?"),
         (3, r"Server stopping\.\.\."),
         (5, r"Daemon thread started\. Thread id = 0x[0-9A-F]+"),
         (5, r"Adding user session 0x[0-9A-F]+\."),
@@ -293,6 +323,7 @@ class Installation:
         self.web.chmod(0o755)
         self.port = free_port()
         self.user = None
+        self.owner = None
         self.servers = []
         self._output = 0
         self._expected = {"err": [], "status": [], "startup": []}
@@ -302,7 +333,10 @@ class Installation:
             "Audit": {},
             "RemoteConfiguration": {"WebAddress": "127.0.0.1", "WebPort": str(self.port)},
         }
-        (self.root / "oxm_oxx").mkdir()
+        self.data = self.root / "oxm_oxx" / "datfiles"
+        self.data.mkdir(parents=True)
+        self.users = self.data / "users"
+        self.users.mkdir(mode=0o700)
         (self.root / "oxm_oxx").chmod(0o755)
         self.main_ini = self.root / "oxm_oxx" / "oxm_oxx.ini"
         self.main_ini.write_text("[interface]\nersaddress=127.0.0.1:1\n")
@@ -347,8 +381,44 @@ class Installation:
             os.utime(path, (mtime, mtime))
         return path
 
+    def user_file(self, name, content):
+        path = self.users / name
+        path.write_bytes(content)
+        path.chmod(0o600)
+        self._own(path)
+        return path
+
+    def add_user(self, name, password="secret", permissions=0, *, file=None, more=""):
+        """Writes a user file as people do. Without a password (None) any password is good."""
+        lines = [f"username={name}", f"permissions={permissions}"]
+        if password is not None:
+            lines.insert(1, f"PlaintextPassword={password}")
+        text = "[UserInfo]\n" + "".join(f"{line}\n" for line in lines) + more
+        return self.user_file(file or f"{name}.usr", text.encode())
+
+    def add_profile(self, name, users, directory="profiles"):
+        """Writes a profile file; the main settings file names its directory from then on."""
+        path = self.root / directory / name
+        path.parent.mkdir(exist_ok=True)
+        path.write_text(f"[Profile]\nUsers={users}\n")
+        self.main_ini.write_text(f"[interface]\nersaddress=127.0.0.1:1\n[defaults]\nprofilesdir=./{directory}\n")
+        self._own(path.parent, path)
+        return path
+
+    def add_report(self, name, content=b"<html>a report</html>\n"):
+        path = self.data / "reports" / name
+        path.parent.mkdir(parents=True, exist_ok=True)
+        path.write_bytes(content)
+        return path
+
+    def _own(self, *paths):
+        if self.owner is not None:
+            for path in paths:
+                os.chown(path, self.owner, self.owner)
+
     def give_to(self, uid):
-        """Makes `uid` the owner of the tree (root only)."""
+        """Makes `uid` the owner of the tree (root only), also of the user and profile files that are still to come."""
+        self.owner = uid
         for directory, folders, files in os.walk(self.root):
             for name in [directory] + [os.path.join(directory, n) for n in folders + files]:
                 os.lchown(name, uid, uid)
@@ -386,6 +456,8 @@ class Installation:
         self.root = self.root.rename(self.scratch / name)
         self.exe, self.web, self.ini = self.root / "ox_remote", self.root / "wwwroot", self.root / "ox_remote.ini"
         self.main_ini = self.root / "oxm_oxx" / "oxm_oxx.ini"
+        self.data = self.root / "oxm_oxx" / "datfiles"
+        self.users = self.data / "users"
 
     def _log_files(self, which):
         if which == "startup":
@@ -408,6 +480,14 @@ class Installation:
 
     def status(self):
         return [STAMP.sub("", line, count=1) for line in self._lines(self.status_log)]
+
+    def setup_lines(self):
+        """What a start says at level 3 before it opens its access log, where no profiles are set up."""
+        return [
+            f"User database directory: {self.users}.",
+            f"Log analysis configuration file: {self.main_ini}.",
+            "Profile configuration file: .",
+        ]
 
     def startup(self):
         return [STAMP.sub("", line, count=1) for line in self._lines(self.startup_log)]
@@ -546,8 +626,9 @@ class Installation:
         left = []
         for name in os.listdir("/proc"):
             if name.isdigit():
-                with contextlib.suppress(OSError):
-                    if os.readlink(f"/proc/{name}/exe").startswith(str(self.scratch)) and is_alive(int(name)):
+                with contextlib.suppress(OSError):  # script engines run from elsewhere, but in the directory
+                    places = [os.readlink(f"/proc/{name}/{link}") for link in ("exe", "cwd")]
+                    if any(place.startswith(str(self.scratch)) for place in places) and is_alive(int(name)):
                         left.append(int(name))
         return left
 
@@ -609,6 +690,16 @@ class Server:
 
     def alive(self):
         return self.process.poll() is None
+
+    def reset(self):
+        """Makes the server stop and start, with its settings and users read again."""
+
+        def starts():
+            return sum(line.startswith("Starting server: ") for line in self.site.err())
+
+        before = starts()
+        self.signal(16)
+        wait_until(lambda: starts() == before + 1 and is_listening(self.site.port), "the next start")
 
     def stdout(self):
         return self.out_file.read_bytes().decode("latin-1")
@@ -806,6 +897,12 @@ def exchange(port, data, *, end=False, **how):
 
 def request_text(path, *headers, method="GET", version="HTTP/1.0"):
     return "".join(f"{line}\r\n" for line in (f"{method} {path} {version}", *headers, "")).encode("latin-1")
+
+
+def basic(user, password):
+    """The header of a login; the parts are text or bytes."""
+    parts = [part.encode() if isinstance(part, str) else part for part in (user, password)]
+    return "Authorization: Basic " + base64.b64encode(b":".join(parts)).decode()
 
 
 def get(port, path, *headers, method="GET", **how):

@@ -12,6 +12,7 @@ from harness import (
     STAMP,
     ACCESS_LINE,
     Background,
+    basic,
     request_text,
     shown_host_name,
     wait_until,
@@ -117,10 +118,12 @@ def test_logs_under_other_names(site):
     assert not (site.root / "ox_remote.log").exists() and not (site.root / "ox_remote.err").exists()
 
 
-def test_the_log_files_are_not_served(site, server):
+def test_the_log_files_are_not_served(site):
+    site.add_user("alice")
+    site.serve()
     site.get("/hello.htm")
     for name in ("ox_remote.log", "ox_remote.err", "ox_remote.ini", "ox_remote.pid", "oxm_oxx/oxm_oxx.ini"):
-        assert site.get("/" + name).status == 404
+        assert site.get("/" + name, basic("alice", "secret")).status == 404
 
 
 def masked(lines):
@@ -133,10 +136,11 @@ def test_the_whole_message_log_of_one_request_at_level_9(site):
     wait_until(lambda: site.err()[-1] == "HttpDaemon thread: accepting connection:", "the listener waits")
     site.get("/hello.htm")
     server.wait_idle()
-    wait_until(lambda: len(site.err()) == 9, "the listener waits again")
+    wait_until(lambda: len(site.err()) == 12, "the listener waits again")
     server.stop()
     assert masked(site.err()) == [
         "Debug level is now 9.",
+        *site.setup_lines(),
         f"Logging server activity to {site.root}/ox_remote.log.",
         f"Starting server: connecting to 127.0.0.1 on port {site.port}.",
         "Daemon thread started. Thread id = 0x?",

@@ -243,6 +243,9 @@ def test_pid_file_and_start_up_log_are_named_after_the_program(site, name, stem)
 @pytest.mark.parametrize("name", ["back\\slash", "\\", "two  blanks ", " dir.with\\all . "], ids=repr)
 def test_any_name_of_the_installation_directory_will_do(site, name, form):
     site.rename(name)
+    if " " in name:
+        line = r'Scripts cannot run: the directory name ".*" has a blank or control character in it\.'
+        site.expect("err", line, times=1)
     argv0 = str(site.exe) if form == "absolute" else form
     assert site.run("-status", argv0=argv0) == (1, BANNER + not_running(2))
     server = site.serve(argv0=argv0)

@@ -14,6 +14,7 @@ from harness import (
     REPLY_413,
     Client,
     Reply,
+    basic,
     http_time,
     parse_http_time,
     request_text,
@@ -22,6 +23,7 @@ from harness import (
 
 GIF = b"GIF89a\x01\0\x01\0\x80\0\0\0\0\0\xff\xff\xff!\xf9\x04\x01\0\0\0\0,\0\0\0\0\x01\0\x01\0\0\x02\x02D\x01\0;"
 MTIME = 1700000000
+LOGIN = basic("alice", "secret")  # what lies below the top directory asks for one
 LAST_MODIFIED = "Tue, 14 Nov 2023 22:13:20 GMT"
 THIRTY_DAYS = 2592000
 
@@ -51,10 +53,10 @@ def ok_head(content_type, image=False, last_modified=LAST_MODIFIED):
     )
 
 
-def check_file(site, name, content_type, *, url=None, image=False, content=b"some content\n", **how):
+def check_file(site, name, content_type, *headers, url=None, image=False, content=b"some content\n", **how):
     site.page(name, content, MTIME)
     before = int(time.time())
-    raw = site.raw(request_text(url or "/" + name, **how))
+    raw = site.raw(request_text(url or "/" + name, *headers, **how))
     check_reply(raw, ok_head(content_type, image) + content, before)
 
 
@@ -94,8 +96,10 @@ def test_a_slash_at_the_end_means_the_default_file(site, server):
     check_file(site, "default.htm", "text/html", url="/")
 
 
-def test_the_extension_is_that_of_the_file_and_not_of_a_directory(site, server):
-    check_file(site, "a.gif/plain", "")
+def test_the_extension_is_that_of_the_file_and_not_of_a_directory(site):
+    site.add_user("alice")
+    site.serve()
+    check_file(site, "a.gif/plain", "", LOGIN)
 
 
 @pytest.mark.parametrize("method", ["GET", "HEAD", "POST"])
@@ -155,9 +159,11 @@ def test_a_declared_content_type_replaces_any_type(site, server):
 @pytest.mark.parametrize(
     "path", ["/absent.htm", "/hello.htm/", "/ox_remote.log", "/ox_remote.ini", "/a%2e%2e%2fb", "/x" * 4000]
 )
-def test_what_does_not_exist_is_not_found(site, server, path):
+def test_what_does_not_exist_is_not_found(site, path):
+    site.add_user("alice")
+    site.serve()
     site.get("/hello.htm")  # so that the access log exists
-    assert site.raw(request_text(path)) == REPLY_404
+    assert site.raw(request_text(path, LOGIN)) == REPLY_404
 
 
 def test_a_file_without_read_permission_is_not_found(site):
@@ -283,9 +289,11 @@ def test_a_directory_without_a_slash_gets_an_empty_answer_and_a_line(site, serve
     site.expect("err", r"Reply error reading file - handle = \d+", times=1)
 
 
-def test_a_directory_without_a_default_file_is_not_found(site, server):
+def test_a_directory_without_a_default_file_is_not_found(site):
+    site.add_user("alice")
+    site.serve()
     (site.web / "dir").mkdir()
-    assert site.raw(request_text("/dir/")) == REPLY_404
+    assert site.raw(request_text("/dir/", LOGIN)) == REPLY_404
 
 
 def test_a_fifo_holds_nobody_up(site, server):

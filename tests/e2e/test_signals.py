@@ -227,14 +227,16 @@ def test_the_lines_of_a_reset(site):
     site.configure(audit={"debuglevel": 3})
     server = site.serve()
     assert site.err() == [
+        *site.setup_lines(),
         f"Logging server activity to {site.root}/ox_remote.log.",
         f"Starting server: connecting to 127.0.0.1 on port {site.port}.",
     ]
     server.signal(RESET)
     wait_until(lambda: resets(site) == 2 and is_listening(site.port), "the second start")
-    assert site.err()[2:] == [
+    assert site.err()[5:] == [
         "Server stopping...",
         "Server log closed.",
+        *site.setup_lines(),
         "Logging server activity to ./ox_remote.log.",
         f"Starting server: connecting to 127.0.0.1 on port {site.port}.",
     ]

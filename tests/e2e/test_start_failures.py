@@ -72,7 +72,7 @@ def test_a_port_in_use_at_level_9(site, occupied, logging):
     lines = in_use_lines(occupied)
     opened = [f"Logging server activity to {site.root}/ox_remote.log."] if logging else []
     closed = ["Server log closed."] if logging else []
-    assert site.err() == ["Debug level is now 9.", *opened, *lines[:2], *closed, lines[2]]
+    assert site.err() == ["Debug level is now 9.", *site.setup_lines(), *opened, *lines[:2], *closed, lines[2]]
     assert [line for line in site.status() if line in FAILED] == FAILED
     for line in lines:
         site.allow("err", re.escape(line))

@@ -18,7 +18,7 @@
 #include "platform/assertion.h"
 #include "platform/poll.h"
 #include "platform/text.h"
-#include "procchild.h"
+#include "proc/child.h"
 
 namespace {
 using namespace std::chrono_literals;

@@ -34,7 +34,9 @@ oxxHttpServer::oxxHttpServer(oxApplicationCallback outside, const oxClock& clock
 }
 
 oxxHttpServer::~oxxHttpServer() {
-    Close();
+    // Sessions use what this class holds.
+    while (!Close()) {
+    }
     --m_nInstances;
     if (m_poxxHttpServer == this)
         m_poxxHttpServer = nullptr;
@@ -70,8 +72,7 @@ void oxxHttpServer::LoadProfiles(const oxxSetup& setup) {
     if (directory.starts_with('.'))
         directory = oxFilename::Join(setup.homeDirectory, directory);
     MessageLog().Log(3, "Profile configuration file: %s.", directory.c_str());
-    if (!directory.empty())
-        m_ProfileMap.Load(directory);
+    m_ProfileMap.Load(directory);
 }
 
 std::shared_ptr<const oxxSetup> oxxHttpServer::Setup() const {

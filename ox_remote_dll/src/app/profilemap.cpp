@@ -27,7 +27,11 @@ oxxProfileMap::~oxxProfileMap() = default;
 
 void oxxProfileMap::Load(const std::string& directory) {
     const std::scoped_lock lock(m_changing);
-    m_directory = directory;
+    if (m_directory != directory) {
+        m_directory = directory;
+        m_profiles.clear();
+        Publish();
+    }
     oxDirIterator files(directory, m_sPROFILE_FILE_MASK);
     if (!files.IsValid())
         return;

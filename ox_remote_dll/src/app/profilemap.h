@@ -33,7 +33,8 @@ public:
     oxxProfileMap();
     virtual ~oxxProfileMap();
 
-    // Remembers the directory and reads every profile file in it.
+    // Remembers the directory and reads every profile file in it. The profiles of another directory go, whether the new
+    // one can be read or not; an empty name is a directory without profiles.
     void Load(const std::string& directory);
     // Reads one profile file again. A name that cannot be a profile's ("/", a leading dot, another ending) does
     // nothing.

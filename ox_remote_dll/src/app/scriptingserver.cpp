@@ -40,7 +40,8 @@ oxScriptingHttpServer::oxScriptingHttpServer(oxApplicationCallback callback, con
 }
 
 oxScriptingHttpServer::~oxScriptingHttpServer() {
-    Close();
+    while (!Close()) {
+    }
 }
 
 std::unique_ptr<oxResource_Script> oxScriptingHttpServer::CreateScript(const std::string& homeDirectory,

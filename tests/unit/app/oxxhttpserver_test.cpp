@@ -37,6 +37,19 @@ TEST_F(OxxHttpServer, ProfilesDirectoryThatDoesNotBeginWithADotIsTakenAsItIs) {
     EXPECT_TRUE(oxxHttpServer::m_ProfileMap.IsPermitted("alice", "x"));
 }
 
+TEST_F(OxxHttpServer, ProfilesGoWithTheirSetting) {
+    EXPECT_TRUE(oxxHttpServer::m_ProfileMap.IsPermitted("bob", "sales"));
+    dir.Write("oxm_oxx/oxm_oxx.ini", "[defaults]\nprofilesdir=\n");
+    SetUp("", "");
+    EXPECT_FALSE(oxxHttpServer::m_ProfileMap.IsPermitted("bob", "sales"));
+    dir.Write("oxm_oxx/oxm_oxx.ini", "[defaults]\nprofilesdir=./profiles\n");
+    SetUp("", "");
+    EXPECT_TRUE(oxxHttpServer::m_ProfileMap.IsPermitted("bob", "sales"));
+    dir.Write("oxm_oxx/oxm_oxx.ini", "[defaults]\nprofilesdir=./none\n");
+    SetUp("", "");
+    EXPECT_FALSE(oxxHttpServer::m_ProfileMap.IsPermitted("bob", "sales"));
+}
+
 TEST_F(OxxHttpServer, DirectoryWithABlankIsReported) {
     std::filesystem::create_directories(dir.File("a b/wwwroot"));
     oxConfig config;

@@ -243,9 +243,20 @@ TEST_F(oxxProfileMapTest, LoadForgetsWhatIsGone) {
 TEST_F(oxxProfileMapTest, DirectoryThatCannotBeListedKeepsTheOldEntries) {
     Profile("sales.wlp", "alice");
     Load();
+    const std::filesystem::path aside = dir.Path() + ".aside";
+    std::filesystem::rename(dir.Path(), aside);
+    Load();
+    std::filesystem::rename(aside, dir.Path());
+    EXPECT_TRUE(map.IsPermitted("alice", "sales.wlp"));
+}
+
+TEST_F(oxxProfileMapTest, AnotherDirectoryTakesTheOldEntriesAwayWhateverIsInIt) {
     for (const std::string& directory : {dir.File("none"), dir.File("sales.wlp"), std::string()}) {
+        Profile("sales.wlp", "alice");
+        Load();
+        EXPECT_TRUE(map.IsPermitted("alice", "sales.wlp"));
         map.Load(directory);
-        EXPECT_TRUE(map.IsPermitted("alice", "sales.wlp")) << directory;
+        EXPECT_FALSE(map.IsPermitted("alice", "sales.wlp")) << directory;
     }
 }
 

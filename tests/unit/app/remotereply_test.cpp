@@ -10,7 +10,7 @@ namespace {
 
 using namespace std::string_literals;
 
-// As large as a thread's stack should not hold twice.
+// 66 KB: on the heap here.
 std::unique_ptr<oxRemoteReply> MakeReply() {
     return std::make_unique<oxRemoteReply>();
 }

@@ -1,4 +1,4 @@
-#include "procchild.h"
+#include "proc/child.h"
 
 #include <gtest/gtest.h>
 #include <signal.h>

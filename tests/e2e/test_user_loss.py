@@ -115,6 +115,8 @@ def test_a_file_that_cannot_be_read_concerns_its_user_only(site):
     server = serve(site)
     assert not opens(site, "alice", "secret") and not opens(site, "alice", "")
     assert opens(site, "bob", "secret")
+    server.reset()  # told once
+    site.expect("status", re.escape(f"User file {path} cannot be read: Permission denied"), times=1)
     path.chmod(0o600)
     server.reset()
     assert opens(site, "alice", "secret")
@@ -127,6 +129,7 @@ def test_a_user_whose_file_became_unreadable_is_kept_as_it_was(site):
     path.chmod(0)
     server.reset()
     assert opens(site, "alice", "secret") and not opens(site, "alice", "")
+    site.expect("status", re.escape(f"User file {path} cannot be read: Permission denied"), times=1)
 
 
 def not_found_line(site):

@@ -16,8 +16,7 @@ struct oxRemoteAddress {
     static oxRemoteAddress Parse(const std::string& text);
 };
 
-// One value for all of it: a reset replaces it as a whole, and a request that is being answered keeps the one it
-// started with.
+// One value for all of it: a reset replaces it as a whole.
 struct oxxSetup {
     static constexpr const char* sSCRIPT_INC_DIR = "ox_script";
     static constexpr const char* sSCRIPT_DIR = "scripts";
@@ -39,7 +38,7 @@ struct oxxSetup {
     oxRemoteAddress remote;
     int ersTimeout = DEFAULT_ERS_TIMEOUT;
     int ersRetries = DEFAULT_ERS_RETRIES;
-    // Absolute.
+    // Absolute; the users directory as the settings name it.
     std::string homeDirectory;
     std::string documentRoot;
     std::string scriptsDirectory;

@@ -45,15 +45,26 @@ oxxHttpServer::~oxxHttpServer() {
 void oxxHttpServer::SetUp(const oxConfig& config, const char* section, const oxHttpSettings& web,
                           const std::string& remoteAddress) {
     Configure(web);
-    auto setup = std::make_shared<const oxxSetup>(
+    const auto setup = std::make_shared<const oxxSetup>(
         oxxSetup::Read(config, section, web.homeDirectory, web.documentRoot, remoteAddress));
     if (!oxUrlPath(setup->homeDirectory).FitsCommandLine())
         MessageLog().Error("Scripts cannot run: the directory name \"%s\" has a blank or control character in it.",
                            LogText(setup->homeDirectory).c_str());
+    // Requests that outlive a reset meet the new users under the stricter of the two rules: where accounts prove the
+    // password, a user file needs none.
+    const bool stricter = setup->osAuthentication;
+    if (stricter)
+        Publish(setup);
     OpenUsers(*setup);
     LoadProfiles(*setup);
+    if (!stricter)
+        Publish(setup);
+}
+
+void oxxHttpServer::Publish(const std::shared_ptr<const oxxSetup>& setup) {
+    auto old = setup;
     const std::scoped_lock lock(m_setupLock);
-    m_setup.swap(setup);
+    m_setup.swap(old);
 }
 
 void oxxHttpServer::OpenUsers(const oxxSetup& setup) {

@@ -26,8 +26,9 @@ class oxUrlPath;
 // Life: `SetUp` with the settings, then `StartAuthenticated`; a reset stops it and does both again. The user bases and
 // the profile map are shared by all objects of the class and never destroyed.
 //
-// Thread rules: as its bases. Routing and commands run on session threads, many at once; a request keeps the setup that
-// it started with. Errors: every refusal is a reply, every failure of the set-up a line in the message log.
+// Thread rules: as its bases. Routing and commands run on session threads, many at once; one that outlives a reset may
+// meet the old setup or the new one. Errors: every refusal is a reply, every failure of the set-up a line in the
+// message log.
 class oxxHttpServer : public oxScriptingHttpServer {
 public:
     static constexpr const char* sIMAGES_DIR = "images";
@@ -90,6 +91,7 @@ public:
 private:
     class Login;
 
+    void Publish(const std::shared_ptr<const oxxSetup>& setup);
     void OpenUsers(const oxxSetup& setup);
     void LoadProfiles(const oxxSetup& setup);
     bool AnonymousMaySee(const std::string& profile);

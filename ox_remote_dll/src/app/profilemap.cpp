@@ -27,14 +27,16 @@ oxxProfileMap::~oxxProfileMap() = default;
 
 void oxxProfileMap::Load(const std::string& directory) {
     const std::scoped_lock lock(m_changing);
-    if (m_directory != directory) {
-        m_directory = directory;
-        m_profiles.clear();
-        Publish();
-    }
+    const bool another = m_directory != directory;
+    if (another)
+        m_profiles.clear();  // published with the new ones, in one step
+    m_directory = directory;
     oxDirIterator files(directory, m_sPROFILE_FILE_MASK);
-    if (!files.IsValid())
+    if (!files.IsValid()) {
+        if (another)
+            Publish();
         return;
+    }
     Profiles profiles;
     while (const std::string* name = files.Next()) {
         Users users;

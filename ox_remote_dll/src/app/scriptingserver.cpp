@@ -4,6 +4,7 @@
 #include <chrono>
 
 #include "app/urltext.h"
+#include "platform/encrypt.h"
 
 namespace {
 
@@ -18,7 +19,7 @@ char* ReplyBuffer() {
 class RawText {
 public:
     explicit RawText(const char* text) { Current() = text; }
-    ~RawText() { Current().clear(); }
+    ~RawText() { WipeText(Current()); }  // may hold a password
     RawText(const RawText&) = delete;
     RawText& operator=(const RawText&) = delete;
 

@@ -51,24 +51,34 @@ oxUserBase::oxUserBase(const std::string& directory) {
 oxUserBase::~oxUserBase() = default;
 
 bool oxUserBase::Open(const std::string& directory) {
-    const std::scoped_lock lock(m_mutex);
+    const std::scoped_lock changing(m_changing);
     if (directory != m_directory.Path()) {
+        const std::scoped_lock lock(m_mutex);
         m_directory = oxUserDirectory(directory);
         m_files.clear();
         if (!std::exchange(m_users, Users()).empty())
             ++m_generation;
     }
-    return Load();
+    const Files before = m_files;
+    const bool loaded = Load();
+    // Whoever starts or resets the server is told again what else is told once.
+    for (const auto& [name, file] : m_files) {
+        const auto old = before.find(name);
+        if (old != before.end() && old->second == file)
+            Report(*file);
+    }
+    return loaded;
 }
 
 bool oxUserBase::LoadAll() {
-    const std::scoped_lock lock(m_mutex);
+    const std::scoped_lock changing(m_changing);
     return Load();
 }
 
 bool oxUserBase::SaveUser(const std::string& name) {
-    const std::scoped_lock lock(m_mutex);
+    const std::scoped_lock changing(m_changing);
     const oxUserDirectory::Lock directoryLock(m_directory);
+    const std::scoped_lock lock(m_mutex);
     FilePointer* const file = Find(name);
     if (file == nullptr)
         return false;
@@ -82,8 +92,9 @@ bool oxUserBase::SaveUser(const std::string& name) {
 }
 
 bool oxUserBase::Change(const std::string& name, const std::function<void(oxUserRecord&)>& change) {
-    const std::scoped_lock lock(m_mutex);
+    const std::scoped_lock changing(m_changing);
     const oxUserDirectory::Lock directoryLock(m_directory);
+    const std::scoped_lock lock(m_mutex);
     if (Reload() != 0)
         return false;
     FilePointer* const file = Find(name);
@@ -120,11 +131,12 @@ bool oxUserBase::AddUser(const std::string& name, const std::string& password, s
         return false;
     if (!IsName(name) || password.size() > MAX_PASSWORD || !IsText(maxProfiles) || !IsText(logFileUrl))
         return false;
-    const std::scoped_lock lock(m_mutex);
+    const std::scoped_lock changing(m_changing);
     const oxUserDirectory::Lock directoryLock(m_directory);
+    const std::scoped_lock lock(m_mutex);
     // The first user of an installation makes the directory; users that cannot be listed might hold the name.
     const int error = Reload();
-    if ((error != 0 && error != ENOENT) || Find(name) != nullptr)
+    if ((error != 0 && error != ENOENT) || HasFile(name))
         return false;
     if (!m_directory.Create()) {
         std::fputs("Couldn't create user config directory.\n", stderr);
@@ -147,30 +159,33 @@ bool oxUserBase::AddUser(const std::string& name, const std::string& password, s
 }
 
 bool oxUserBase::DeleteUser(const std::string& name) {
-    const std::scoped_lock lock(m_mutex);
+    const std::scoped_lock changing(m_changing);
     const oxUserDirectory::Lock directoryLock(m_directory);
+    const std::scoped_lock lock(m_mutex);
     if (Reload() != 0)
         return false;
-    const auto user = m_users.find(name);
-    if (user == m_users.end())
-        return false;
     // The file that counts goes last: until then nothing has changed for the user.
+    const auto user = m_users.find(name);
+    const std::string counting = user != m_users.end() ? user->second : std::string();
     std::vector<std::string> fileNames;
     for (const auto& [fileName, file] : m_files) {
-        if (file->content.record.name == name && fileName != user->second)
+        if (file->content.record.name == name && fileName != counting)
             fileNames.push_back(fileName);
     }
-    fileNames.push_back(user->second);
+    if (!counting.empty())
+        fileNames.push_back(counting);
     for (const std::string& fileName : fileNames) {
         if (!m_directory.Remove(fileName))
             return false;
-        if (fileName != user->second)
+        if (fileName != counting)
             m_files.erase(fileName);
     }
-    m_files.erase(user->second);
-    m_users.erase(user);
-    ++m_generation;
-    return true;
+    if (!counting.empty()) {
+        m_users.erase(user);
+        m_files.erase(counting);
+        ++m_generation;
+    }
+    return !fileNames.empty();
 }
 
 bool oxUserBase::SetPermissions(const std::string& name, std::uint32_t permissions) {

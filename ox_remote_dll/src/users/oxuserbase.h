@@ -87,6 +87,7 @@ private:
         oxUserFile::Content content;
         oxFileStamp stamp;
         bool readAgain = true;  // at the next reload, whatever the stamp says then
+        int readError = 0;      // why it could not be read the last time; then the rest is from before, or empty
 
         bool IsUser() const { return content.state == oxUserFile::State::User; }
     };
@@ -94,13 +95,16 @@ private:
     using Files = std::map<std::string, FilePointer>;  // by file name
     using Users = std::map<std::string, std::string>;  // from user name to the file that counts
 
-    // Want the mutex to be held.
-    bool Load();
+    bool Load();  // wants m_changing to be held, as Report
+    static void Report(const File& file);
+    // Want both to be held.
     int Reload();  // 0 or an errno value
     FilePointer Look(const std::string& fileName, const FilePointer& known);
+    static FilePointer Unread(const std::string& path, int error, const FilePointer& known, const File& empty);
     void EncipherPlaintexts();
     bool IsSame(const Users& users, const Files& files) const;
     FilePointer* Find(const std::string& name);
+    bool HasFile(const std::string& name) const;
     bool Store(const File& file);
 
     bool Change(const std::string& name, const std::function<void(oxUserRecord&)>& change);
@@ -108,7 +112,9 @@ private:
     oxUserDirectory m_directory;
     Files m_files;
     Users m_users;
-    MMutex m_mutex;
+    // Held through a whole change, its wait for other processes included; logins wait for the other one only.
+    MMutex m_changing;
+    MMutex m_mutex;                                 // over the two maps and every file operation
     [[maybe_unused]] std::int32_t m_reserved = -1;  // kept; nothing reads it
     std::atomic<std::uint64_t> m_generation{1};
     std::atomic<std::uint64_t> m_filesRead{0};

@@ -2,18 +2,19 @@
 #include <algorithm>
 #include <cerrno>
 #include <cstdio>
+#include <mutex>
 #include <utility>
 
 #include "platform/directory.h"
 #include "platform/encrypt.h"
+#include "platform/text.h"
 #include "support/logtext.h"
 #include "users/oxuserbase.h"
 
 using State = oxUserFile::State;
 
-namespace {
-
-void Report(const oxUserFile::Content& content) {
+void oxUserBase::Report(const File& file) {
+    const oxUserFile::Content& content = file.content;
     const std::string name = LogText(content.record.name);
     switch (content.state) {
         case State::PlaintextTooLong:
@@ -31,10 +32,9 @@ void Report(const oxUserFile::Content& content) {
     }
 }
 
-}  // namespace
-
 bool oxUserBase::Load() {
     const oxUserDirectory::Lock directoryLock(m_directory);
+    const std::scoped_lock lock(m_mutex);
     m_directory.RemoveLeftovers(directoryLock);
     return Reload() == 0;
 }
@@ -81,13 +81,25 @@ oxUserBase::FilePointer oxUserBase::Look(const std::string& fileName, const File
     if (error == EISDIR || error == EINVAL || error == EFBIG)
         return file;  // nobody's
     if (error != 0)
-        return known;
+        return Unread(path, error, known, *file);
     file->content = oxUserFile::Parse(text);
     WipeText(text);
     // The key may come back, and a file that could not be rewritten may become writable, without the file changing.
     file->readAgain = !isStampCertain || file->content.state == State::Undecipherable || file->content.isPlaintext;
     if (!known || known->content != file->content || known->stamp != file->stamp)
-        Report(file->content);
+        Report(*file);
+    return file;
+}
+
+// The file as it was before, or nobody's when it was never read. Each reason is told once.
+oxUserBase::FilePointer oxUserBase::Unread(const std::string& path, int error, const FilePointer& known,
+                                           const File& empty) {
+    if (known && known->readError == error)
+        return known;
+    std::fprintf(stderr, "User file %s cannot be read: %s\n", LogText(path).c_str(), GetLastErrorText(error));
+    const auto file = std::make_shared<File>(known ? *known : empty);
+    file->readAgain = true;
+    file->readError = error;
     return file;
 }
 
@@ -120,6 +132,12 @@ oxUserBase::FilePointer* oxUserBase::Find(const std::string& name) {
     return user != m_users.end() ? &m_files.find(user->second)->second : nullptr;
 }
 
+// Also by one that cannot be used: a second file of the name would lose against it once it is mended.
+bool oxUserBase::HasFile(const std::string& name) const {
+    return std::any_of(m_files.begin(), m_files.end(),
+                       [&](const Files::value_type& file) { return file.second->content.record.name == name; });
+}
+
 bool oxUserBase::Store(const File& file) {
     if (!m_directory.Create()) {
         std::fputs("Couldn't create user config directory.\n", stderr);
@@ -132,5 +150,7 @@ bool oxUserBase::Store(const File& file) {
     const int error = oxUserFile::Read(m_directory.PathOf(file.name), before, stamp, isStampCertain);
     if (error != 0 && error != ENOENT)
         return false;
-    return oxUserFile::Compose(before, file.content.record, after) && m_directory.Replace(file.name, after);
+    const bool composed = oxUserFile::Compose(before, file.content.record, after);
+    WipeText(before);  // may hold the password in clear
+    return composed && m_directory.Replace(file.name, after);
 }

@@ -147,13 +147,12 @@ bool oxProc::IsParent() const {
     return getpid() == m_parentPid;
 }
 
-int oxProc::DescribeEnd(int pid, int status, std::string& text) {
+// Without allocating: the child is reaped by now, and must not be forgotten for want of memory.
+int oxProc::DescribeEnd(int pid, int status, char* text, std::size_t size) {
     constexpr int SIGNAL_BITS = 0x7F;
     constexpr int CORE_FLAG = 0x80;
     const auto say = [&](const char* format, int code) {
-        char line[64];
-        std::snprintf(line, sizeof line, format, pid, code);
-        text = line;
+        std::snprintf(text, size, format, pid, code);
         return code;
     };
     const int signalBits = status & SIGNAL_BITS;
@@ -181,10 +180,7 @@ int oxProc::Look() {
     if (m_lastWait == 0)
         return STILL_RUNNING;
     if (m_lastWait == m_pid) {
-        std::string text;
-        const int result = DescribeEnd(m_pid, status, text);
-        SetErrorText("%s", text.c_str());
-        return Reaped(result);
+        return Reaped(DescribeEnd(m_pid, status, m_errorText, sizeof m_errorText));
     }
     const int error = errno;
     if (error == ECHILD) {

@@ -56,7 +56,7 @@ public:
     static void SetChildFileLimit(const rlimit& limit);
 
     // The result and the text for the status of an ended child.
-    static int DescribeEnd(int pid, int status, std::string& text);
+    static int DescribeEnd(int pid, int status, char* text, std::size_t size);
 
     // Set before Spawn. A Spawn that starts a child takes the descriptors over: it closes them and sets them to 0,
     // which means "as the server's own". After one that failed they are still the caller's.

@@ -33,6 +33,8 @@ constexpr const char* WRITE_TOKEN_TEXT = "OK";
 constexpr const char* ERROR_TEXT = "ERROR";
 constexpr const char* NULL_ARGUMENT = "NULL";
 
+thread_local oxEngineRun* currentRun = nullptr;
+
 bool IsDigit(char c) {
     return c >= '0' && c <= '9';
 }
@@ -119,6 +121,7 @@ int oxRemoteScript::Run(int argc, char** argv, void* context, oxScriptCallback c
         oxRemoteScript& script;
         ~Release() {
             script.m_run = nullptr;
+            currentRun = nullptr;
             script.ReleaseLocks();
         }
     };
@@ -137,6 +140,7 @@ int oxRemoteScript::Run(int argc, char** argv, void* context, oxScriptCallback c
         return RESULT_NOT_SPAWNED;
     m_context = context;
     m_run = &run;
+    currentRun = &run;
     run.Serve(data, [&](const char* message, int length) { return Answer(message, length, callback); });
     return run.AwaitEnd();
 }
@@ -228,6 +232,10 @@ const char* oxRemoteScript::ServeReadLock(const char* pszArgs, int* status) {
     ++m_reads;
     m_locked = rwReading;
     return READ_TOKEN_TEXT;
+}
+
+bool oxRemoteScript::IsCurrentRunOver() {
+    return currentRun != nullptr && currentRun->IsOver();
 }
 
 bool oxRemoteScript::IsOver() const {

@@ -62,6 +62,10 @@ public:
     const char* ServeReadLock(const char* pszArgs, int* status);
     const char* ServeWriteLock(const char* pszArgs, int* status);
 
+    // For call-backs that wait: true when the run that the calling thread serves is over (stopped, past its time limit,
+    // or without its engine), so that nobody wants the answer. False outside of a run.
+    static bool IsCurrentRunOver();
+
     const char* EnginePath() const { return m_enginePath; }
     LockState GetLockState() const { return m_locked; }
 

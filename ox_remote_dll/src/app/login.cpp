@@ -28,10 +28,7 @@ bool oxxHttpServer::CheckOperatingSystem(oxUser& user, UserCheck check) {
         return true;  // has no account
     const std::string name = LogText(user.GetUser());
     if (check == UserCheck::Full) {
-        const auto setup = Setup();
-        char login[LOGIN_NAME_BUFFER] = {};
-        std::snprintf(login, sizeof login, "%s%s%s", setup->ntDomain.c_str(), setup->ntDomain.empty() ? "" : "/",
-                      user.GetUser().c_str());
+        const std::string login = LoginName(Setup()->ntDomain, user.GetUser());
         if (!m_OSUserBase.Authenticate(login, user.GetPassword(), nullptr)) {
             MessageLog().Log(2, "User %s authentication failed.", name.c_str());
             return false;
@@ -39,4 +36,10 @@ bool oxxHttpServer::CheckOperatingSystem(oxUser& user, UserCheck check) {
     }
     MessageLog().Log(2, "User %s authenticated.", name.c_str());
     return true;
+}
+
+std::string oxxHttpServer::LoginName(const std::string& domain, const std::string& user) {
+    char login[LOGIN_NAME_BUFFER] = {};
+    std::snprintf(login, sizeof login, "%s%s%s", domain.c_str(), domain.empty() ? "" : "/", user.c_str());
+    return login;
 }

@@ -66,6 +66,8 @@ public:
     std::unique_ptr<oxResource> CreateResource(const oxRequest& request) override;
     bool AuthenticateUser(oxUser& user, UserCheck check) override;
     virtual const char* GetScriptsDirectory();  // good until the next SetUp
+    // The name that the operating system is asked about; cut where it is too long for LOGIN_NAME_BUFFER.
+    static std::string LoginName(const std::string& domain, const std::string& user);
 
     std::shared_ptr<const oxxSetup> Setup() const;
     oxLoginLockout& Lockout() { return m_lockout; }

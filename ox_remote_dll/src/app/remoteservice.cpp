@@ -14,6 +14,7 @@
 #include "app/remotereply.h"
 #include "net/resolver.h"
 #include "platform/text.h"
+#include "remotescript.h"
 
 namespace {
 
@@ -48,7 +49,7 @@ oxSockAddr FindAddress(const oxRemoteAddress& remote) {
 }
 
 // One exchange of request and reply. Whatever the service does, all of it ends within the time-out times the retries,
-// counted from the construction.
+// counted from the construction, and soon after nobody waits for the answer any more.
 class Exchange {
 public:
     Exchange(oxHttpErrorLog& log, const oxxSetup& setup) : m_log(log), m_end(steady_clock::now() + Patience(setup)) {}
@@ -66,7 +67,7 @@ public:
             return 0;
         if (socket.ErrorCode() != EINPROGRESS)
             return socket.ErrorCode();
-        const Readiness outcome = socket.WaitWritable(Left());
+        const Readiness outcome = Await(socket, &oxSocket::WaitWritable);
         if (outcome != Readiness::Ready)
             return outcome == Readiness::TimedOut ? ETIMEDOUT : socket.GetLastError();
         int error = 0;
@@ -80,14 +81,14 @@ public:
             const int sent = socket.Send(text.data(), static_cast<int>(text.size()), MSG_DONTWAIT);
             if (sent >= 0)
                 text.remove_prefix(static_cast<std::size_t>(sent));
-            else if (socket.ErrorCode() != EAGAIN || socket.WaitWritable(Left()) != Readiness::Ready)
+            else if (socket.ErrorCode() != EAGAIN || Await(socket, &oxSocket::WaitWritable) != Readiness::Ready)
                 return;
         }
     }
 
     int ProcessReply(oxSocket& socket, char* reply, std::size_t replySize) const {
         // As many waits of the time-out as there are retries are one wait for what is left.
-        if (socket.WaitReadable(Left()) != Readiness::Ready || socket.GetHandle() == -1)
+        if (Await(socket, &oxSocket::WaitReadable) != Readiness::Ready || socket.GetHandle() == -1)
             return oxxHttpServer::ERS_UNREACHABLE;
         char buffer[RECEIVE_BUFFER] = {};
         if (!Receive(socket, buffer, sizeof buffer)) {
@@ -108,7 +109,7 @@ public:
         for (;;) {
             int arrived = socket.Recv(buffer + count, static_cast<int>(size - count), MSG_DONTWAIT);
             if (arrived < 0 && socket.ErrorCode() == EAGAIN) {
-                const Readiness outcome = socket.WaitReadable(Left());
+                const Readiness outcome = Await(socket, &oxSocket::WaitReadable);
                 if (outcome == Readiness::Ready)
                     continue;
                 if (outcome == Readiness::Failed)
@@ -134,6 +135,16 @@ private:
     static milliseconds Patience(const oxxSetup& setup) {
         const auto longest = std::chrono::duration_cast<std::chrono::seconds>(LONGEST_EXCHANGE);
         return std::min(std::chrono::seconds(setup.ersTimeout) * std::int64_t{setup.ersRetries}, longest);
+    }
+    // Timed out also when the script that asked has come to its end, or is to end.
+    Readiness Await(oxSocket& socket, Readiness (oxSocket::*wait)(WaitLimit)) const {
+        for (;;) {
+            const milliseconds left = Left();
+            const Readiness outcome = (socket.*wait)(std::min(left, oxRemoteScript::STOP_TICK));
+            if (outcome != Readiness::TimedOut || left <= oxRemoteScript::STOP_TICK ||
+                oxRemoteScript::IsCurrentRunOver())
+                return outcome;
+        }
     }
     milliseconds Left() const {
         return std::max(std::chrono::ceil<milliseconds>(m_end - steady_clock::now()), milliseconds(0));

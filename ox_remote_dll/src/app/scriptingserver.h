@@ -26,6 +26,7 @@ public:
     ~oxScriptingHttpServer() override;
 
     // A run of the script file with these parameters, limited to the time that the settings give it.
+    // Also what builds a resource from four given values: the engine's directory, the script, and the two texts.
     std::unique_ptr<oxResource_Script> CreateScript(const std::string& homeDirectory, const std::string& scriptFile,
                                                     const std::string& includeDirectory, const std::string& parameters);
 

@@ -56,6 +56,8 @@ public:
     // Makes a waiting time-out thread look again whether it is to end.
     void WakeTimeoutThread();
     bool IsTimeoutThreadIdle() const { return m_timeoutIdle.load(); }
+    // Milliseconds between two sweeps, as of the last start; 0 before it. Not while another thread starts the server.
+    std::uint32_t SweepPeriod() const { return m_timeoutDaemon.Period(); }
 
 protected:
     // Where the generation of the user data comes from; set before the start. Without one, nothing ever changes.

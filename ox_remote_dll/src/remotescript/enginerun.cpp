@@ -200,7 +200,7 @@ WaitLimit oxEngineRun::UntilNextLook() const {
     WaitLimit limit;
     const auto sooner = [&limit](milliseconds time) { limit = limit ? std::min(*limit, time) : time; };
     const auto until = [](Clock::time_point end) { return std::chrono::ceil<milliseconds>(end - Clock::now()); };
-    if (m_proc.EndDescriptor() < 0)
+    if (m_proc.EndDescriptor() < 0 || m_endSeen)
         sooner(NAP);
     if (m_killAt)
         sooner(until(*m_killAt));
@@ -215,9 +215,11 @@ void oxEngineRun::WaitForEvent(bool writing, bool reading) {
     // A number of -1 is passed over; an end that is not asked about would report its hang-up without end.
     std::array<pollfd, 3> entries{{{writing ? m_toEngine.Get() : -1, POLLOUT, 0},
                                    {reading ? m_fromEngine.Get() : -1, POLLIN, 0},
-                                   {m_proc.EndDescriptor(), POLLIN, 0}}};
+                                   {m_endSeen ? -1 : m_proc.EndDescriptor(), POLLIN, 0}}};
     if (PollAll(entries, UntilNextLook()) < 0)
         std::this_thread::sleep_for(NAP);  // no memory at the moment
+    else if (entries[2].revents != 0)
+        m_endSeen = true;
 }
 
 // Writes what there is room for, the data first. False when the data cannot be written.

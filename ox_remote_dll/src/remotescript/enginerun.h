@@ -79,6 +79,7 @@ private:
     bool m_spawned = false;
     bool m_interrupted = false;   // by a limit
     std::optional<int> m_result;  // of the engine, once it is reaped
+    bool m_endSeen = false;       // its end was told; a traced one cannot be reaped at once all the same
     UniqueFd m_toEngine;
     UniqueFd m_fromEngine;
     UniqueFd m_engineStdin;

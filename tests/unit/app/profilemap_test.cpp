@@ -463,6 +463,48 @@ TEST_F(oxxProfileMapTest, ChangesShowNoGap) {
     EXPECT_GT(asked, 0);
 }
 
+// Nor does another directory: whom both permit is permitted all the time, and a list is that of the one or of the
+// other.
+TEST_F(oxxProfileMapTest, AnotherDirectoryShowsNoGap) {
+    constexpr int READERS = 4;
+    constexpr long ROUNDS = 300;
+    for (const char* directory : {"one", "other"}) {
+        for (const char* both : {"p.wlp", "q.wlp"})
+            Profile(directory + "/"s + both, "alice,bob");
+        Profile(directory + "/"s + directory + ".wlp", "alice");
+    }
+    map.Load(dir.File("other"));
+    const std::string other = List("alice");
+    map.Load(dir.File("one"));
+    const std::string one = List("alice");
+    ASSERT_EQ(one, "profile_id=one.wlp&profile_id=p.wlp&profile_id=q.wlp");
+    ASSERT_EQ(other, "profile_id=other.wlp&profile_id=p.wlp&profile_id=q.wlp");
+    std::atomic<bool> done{false};
+    std::atomic<int> refused{0};
+    std::atomic<long> seenOne{0}, seenOther{0};
+    std::vector<std::thread> readers;
+    for (int t = 0; t < READERS; ++t) {
+        readers.emplace_back([&] {
+            while (!done) {
+                refused += !map.IsPermitted("alice", "p.wlp");
+                refused += !map.IsPermitted("bob", "q");
+                refused += !map.IsPermitted("admin", "p.wlp");
+                refused += map.IsPermitted("mallory", "p.wlp");
+                const std::string list = List("alice");
+                seenOne += list == one;
+                seenOther += list == other;
+                refused += list != one && list != other;
+            }
+        });
+    }
+    for (long i = 0; i < ROUNDS || seenOne < ROUNDS || seenOther < ROUNDS; ++i)
+        map.Load(dir.File(i % 2 == 0 ? "other" : "one"));
+    done = true;
+    for (auto& reader : readers)
+        reader.join();
+    EXPECT_EQ(refused, 0);
+}
+
 // Two refreshes at once: the one that reads later wins, whoever of them is faster.
 TEST_F(oxxProfileMapTest, LastChangeOfAFileIsNotLost) {
     Profile("sales.wlp", "user0");

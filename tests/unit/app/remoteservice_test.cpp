@@ -429,6 +429,24 @@ TEST_F(RemoteService, SilentServiceIsGivenUpAfterAllRetriesWithoutALine) {
     EXPECT_EQ(Lines{}, Messages());
 }
 
+// Each set-up stands for a reset.
+TEST_F(RemoteService, ChangedPatienceCountsFromTheNextSetUpOn) {
+    FakeService service([](Peer& peer, const std::string&) { EXPECT_TRUE(peer.WaitForEnd()); });
+    UseService(service.Address(), 600, 600);
+    static const struct {
+        int timeout;
+        int retries;
+    } CASES[] = {{1, 1}, {1, 2}, {2, 1}};
+    for (const auto& c : CASES) {
+        UseService(service.Address(), c.timeout, c.retries);
+        const auto start = steady_clock::now();
+        EXPECT_EQ("-256|", Ask());
+        const auto taken = steady_clock::now() - start;
+        EXPECT_GE(taken, seconds(c.timeout * c.retries));
+        EXPECT_LT(taken, seconds(60)) << c.timeout << "*" << c.retries;
+    }
+}
+
 TEST_F(RemoteService, HalfAnAnswerIsGivenUp) {
     FakeService service([](Peer& peer, const std::string&) {
         EXPECT_TRUE(peer.Send("0|do"));

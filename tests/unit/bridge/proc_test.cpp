@@ -101,9 +101,9 @@ TEST(OxProc, TheEndIsToldInWords) {
         {0x137F, 19, "Child 77 stopped w/code 19."},
     };
     for (const auto& row : rows) {
-        std::string text;
-        EXPECT_EQ(row.result, oxProc::DescribeEnd(77, row.status, text)) << row.status;
-        EXPECT_EQ(row.text, text);
+        char text[oxProc::MAX_ERROR_TEXT + 1];
+        EXPECT_EQ(row.result, oxProc::DescribeEnd(77, row.status, text, sizeof text)) << row.status;
+        EXPECT_STREQ(row.text, text);
     }
 }
 

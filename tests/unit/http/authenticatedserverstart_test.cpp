@@ -104,6 +104,23 @@ TEST_F(AuthenticatedServerStart, IdleUserIsDroppedWhileTheServerRuns) {
     }
 }
 
+TEST_F(AuthenticatedServerStart, SweepsEveryHalfTimeout) {
+    static const struct {
+        const char* userTimeout;  // seconds
+        std::uint32_t period;     // milliseconds
+    } CASES[] = {{"600", 300000}, {"30", 15000}, {"7", 3000}, {"2", 1000}, {"1", 1000}};
+    EXPECT_EQ(server->SweepPeriod(), 0u);
+    for (const auto& c : CASES) {
+        oxConfig config;
+        ASSERT_TRUE(config.OpenText(std::string("[S]\nWebUserTimeout=") + c.userTimeout + "\n"));
+        settings.sessionTimeout = oxHttpSettings::Read(config, "S", dir.Path(), dir.Path(), 1).sessionTimeout;
+        server->Configure(settings);
+        ASSERT_TRUE(server->StartAuthenticated(false));
+        EXPECT_EQ(server->SweepPeriod(), c.period) << c.userTimeout;
+        server->Stop();
+    }
+}
+
 TEST_F(AuthenticatedServerStart, MayBeStoppedAndStartedAgain) {
     for (int i = 1; i <= 20; ++i) {
         ASSERT_TRUE(server->StartAuthenticated(false)) << i;
@@ -128,6 +145,35 @@ TEST_F(AuthenticatedServerStart, LoginFromBeforeAStopIsNotRemembered) {
     gate.WaitUntilReached();
     server->Stop();
     ASSERT_TRUE(server->StartAuthenticated(false));
+    gate.Open();
+    slow.join();
+    EXPECT_EQ(server->UserCount(), 0u);
+}
+
+// A session that outlives the stop may log in before the next start.
+TEST_F(AuthenticatedServerStart, LoginFromBetweenAStopAndAStartIsNotRemembered) {
+    ASSERT_TRUE(server->StartAuthenticated(false));
+    server->Stop();
+    ASSERT_TRUE(server->Ask("alice", "ecila"));
+    ASSERT_EQ(server->UserCount(), 1u);
+    ASSERT_TRUE(server->StartAuthenticated(false));
+    EXPECT_EQ(server->UserCount(), 0u);
+    ASSERT_TRUE(server->Ask("alice", "ecila"));
+    EXPECT_EQ(server->Checks(), Checks(2, 0)) << "checked in full by the rules of the start";
+}
+
+TEST_F(AuthenticatedServerStart, CheckThatBeganBetweenAStopAndAStartIsNotRemembered) {
+    Gate gate;
+    server->onCheck = [&](oxUser&, Check) {
+        gate.Pass();
+        return true;
+    };
+    std::thread slow([&] {
+        std::uint32_t permissions = 0;
+        EXPECT_TRUE(server->AuthenticateRequest(Credentials("alice", "ecila"), permissions));
+    });
+    gate.WaitUntilReached();
+    EXPECT_TRUE(server->StartAuthenticated(false));
     gate.Open();
     slow.join();
     EXPECT_EQ(server->UserCount(), 0u);

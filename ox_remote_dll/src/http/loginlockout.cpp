@@ -61,7 +61,7 @@ bool oxLoginLockout::IsOver(const Failures& failures, std::int64_t now) const {
 }
 
 oxLoginLockout::Queue& oxLoginLockout::QueueFor(std::int32_t count) {
-    return m_queues[static_cast<std::size_t>(std::clamp(count, 1, m_maxFailures) - 1)];
+    return m_queues[static_cast<std::size_t>(std::clamp(count, 1, MAX_FAILURES) - 1)];
 }
 
 // A record without failures, which counts as over.

@@ -2,6 +2,7 @@
 #include <fcntl.h>
 #include <gtest/gtest.h>
 #include <sched.h>
+#include <sys/file.h>
 #include <sys/mount.h>
 #include <sys/resource.h>
 #include <sys/wait.h>
@@ -17,6 +18,7 @@
 #include <vector>
 
 #include "platform/file.h"
+#include "testing/waiting.h"
 #include "userbasefixture.h"
 #include "users/oxuserbase.h"
 
@@ -249,6 +251,49 @@ TEST_F(oxUserBaseCrash, NoProcessUndoesTheChangesOfAnother) {
             EXPECT_TRUE(users.FindUser(writer.key + std::to_string(change), nullptr));
     }
     EXPECT_EQ(1u + 2u * CHANGES, Files().size());
+}
+
+// A change waits while another process makes one, and those who log in do not wait with it.
+TEST_F(oxUserBaseCrash, LoginsDoNotWaitForAnotherProcess) {
+    oxUserBase users(Directory());
+    ASSERT_TRUE(users.AddUser("alice", "secret", 0, "", ""));
+    const auto isWaiting = [this] {
+        int open = 0;  // descriptors of the directory: that of the other process, and one of whoever waits
+        for (const auto& entry : std::filesystem::directory_iterator("/proc/self/fd")) {
+            std::error_code error;
+            open += std::filesystem::read_symlink(entry.path(), error) == std::filesystem::canonical(Directory());
+        }
+        return open == 2;
+    };
+    unsigned permissions = 0;
+    const auto logInWhileAChangeWaits = [&] {
+        const UniqueFd other = OpenFile(Directory(), O_RDONLY | O_DIRECTORY);
+        EXPECT_EQ(0, flock(other.Get(), LOCK_EX));
+        std::atomic<bool> done{false};
+        bool changed = false;
+        std::thread change([&] {
+            changed = users.SetPermissions("alice", permissions + 1);
+            done = true;
+        });
+        const bool waited = Eventually([&] { return isWaiting() || done; }) && !done;
+        std::uint32_t found = 99;
+        bool good = users.Authenticate("alice", "secret", &found) && found == permissions;
+        good = users.FindUser("alice", &found) && found == permissions && good;
+        good = ListOf(users) == "u1=alice&p1=" + std::to_string(permissions) && good;
+        const bool waits = isWaiting() && !done;
+        EXPECT_EQ(0, flock(other.Get(), LOCK_UN));
+        change.join();
+        EXPECT_TRUE(changed);
+        ++permissions;
+        return waited && waits && good;
+    };
+    // A change waits for some time only, which a slow machine may let pass.
+    constexpr int ATTEMPTS = 5;
+    bool done = false;
+    for (int i = 0; i < ATTEMPTS && !done; ++i)
+        done = logInWhileAChangeWaits();
+    EXPECT_TRUE(done);
+    EXPECT_EQ("u1=alice&p1=" + std::to_string(permissions), ListOf(users));
 }
 
 TEST_F(oxUserBaseCrash, LoginsGoOnWhileUsersAreChanged) {

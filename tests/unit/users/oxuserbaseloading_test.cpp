@@ -336,6 +336,45 @@ TEST_F(oxUserBaseLoading, AFileThatCannotBeReadKeepsItsUser) {
     EXPECT_FALSE(users.FindUser("alice", nullptr)) << "a file that is gone is no failure";
 }
 
+TEST_F(oxUserBaseLoading, AFileThatCannotBeReadIsToldOncePerReason) {
+    const std::string path = PathOf("alice.usr");
+    const std::string denied = "User file " + path + " cannot be read: Permission denied\n";
+    const std::string loops = "User file " + path + " cannot be read: Too many levels of symbolic links\n";
+    WriteUser("alice.usr", "alice");
+    WriteUser("bob.usr", "bob");
+    oxUserBase users(Directory());
+    ASSERT_EQ(0, chmod(m_scratch.Path().c_str(), 0755));
+    ASSERT_EQ(0, chmod(Directory().c_str(), 0777));
+    ASSERT_EQ(0, chmod(PathOf("bob.usr").c_str(), 0666));
+    const auto toldBy = [](const auto& body) { return StandardErrorOf([&] { AsOrdinaryUser(body); }); };
+    const auto load = [&] { EXPECT_TRUE(users.LoadAll()); };
+
+    std::filesystem::permissions(path, std::filesystem::perms::none);
+    EXPECT_EQ(denied, toldBy(load));
+    EXPECT_EQ("", toldBy(load));
+    EXPECT_EQ("", toldBy([&] { EXPECT_TRUE(users.SetPermissions("bob", 1)); }));
+    EXPECT_EQ("", toldBy([&] { EXPECT_FALSE(users.AddUser("alice", "x", 1, "", "")); }));
+
+    std::filesystem::remove(path);
+    std::filesystem::create_symlink("alice.usr", path);
+    EXPECT_EQ(loops, toldBy(load)) << "another reason";
+    EXPECT_EQ("", toldBy(load));
+    EXPECT_EQ("u1=alice&p1=0&u2=bob&p2=1", ListOf(users)) << "as it was";
+
+    std::filesystem::remove(path);
+    WriteUser("alice.usr", "alice", "permissions=2");
+    ASSERT_EQ(0, chmod(path.c_str(), 0644));
+    EXPECT_EQ("", toldBy(load));
+    EXPECT_EQ("u1=alice&p1=2&u2=bob&p2=1", ListOf(users)) << "readable again";
+    std::filesystem::permissions(path, std::filesystem::perms::none);
+    std::filesystem::rename(path, PathOf("carol.usr"));
+    const std::string moved = "User file " + PathOf("carol.usr") + " cannot be read: Permission denied\n";
+    EXPECT_EQ(moved, toldBy(load)) << "never read under this name";
+    EXPECT_EQ("", toldBy(load));
+    EXPECT_EQ("u1=bob&p1=1", ListOf(users));
+    ASSERT_EQ(0, chmod(Directory().c_str(), 0700));
+}
+
 TEST_F(oxUserBaseLoading, AnotherDirectoryBringsOtherUsers) {
     WriteUser("alice.usr", "alice");
     m_scratch.Write("others/bob.usr", "[UserInfo]\nusername=bob\n");

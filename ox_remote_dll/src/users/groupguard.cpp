@@ -5,6 +5,7 @@
 #include <sys/syscall.h>
 #include <unistd.h>
 
+#include <algorithm>
 #include <cerrno>
 #include <cstdlib>
 #include <new>
@@ -32,7 +33,7 @@ std::vector<gid_t> ThreadGroups() {
     const int count = getgroups(0, nullptr);
     if (count > 0) {
         groups.resize(static_cast<std::size_t>(count));
-        getgroups(count, groups.data());
+        groups.resize(static_cast<std::size_t>(std::max(getgroups(count, groups.data()), 0)));
     }
     return groups;
 }

@@ -64,7 +64,7 @@ bool oxUserBase::Open(const std::string& directory) {
     // Whoever starts or resets the server is told again what else is told once.
     for (const auto& [name, file] : m_files) {
         const auto old = before.find(name);
-        if (old != before.end() && old->second == file)
+        if (old != before.end() && old->second->content == file->content && old->second->stamp == file->stamp)
             Report(*file);
     }
     return loaded;

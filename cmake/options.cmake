@@ -7,6 +7,8 @@ target_compile_definitions(ox_options INTERFACE
   # Files over 2 GB and times after 2038 on 32-bit machines.
   _FILE_OFFSET_BITS=64
   _TIME_BITS=64)
+# Nothing of the program is patched at run time: a child that is being started must not look up symbols, either.
+target_link_options(ox_options INTERFACE -Wl,-z,relro,-z,now)
 target_link_libraries(ox_options INTERFACE Threads::Threads ${CMAKE_DL_LIBS})
 
 if(OX_SANITIZE)

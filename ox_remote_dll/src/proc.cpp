@@ -1,11 +1,13 @@
 #include "proc.h"
 
+#include <sched.h>
 #include <signal.h>
 #include <sys/syscall.h>
 #include <sys/wait.h>
 #include <unistd.h>
 
 #include <algorithm>
+#include <array>
 #include <cerrno>
 #include <cstdarg>
 #include <cstdio>
@@ -34,6 +36,34 @@ constexpr int NOT_WAITED = -2;
 constexpr int ALLOCATION_LINE = 205;
 
 std::optional<rlimit> childFileLimit;
+
+// The sanitizers keep books in the process's memory, which a child must not share with it.
+#if defined(__SANITIZE_THREAD__) || defined(__SANITIZE_ADDRESS__)
+#define OX_CHILD_COPIES_MEMORY 1
+#elif defined(__has_feature)
+#if __has_feature(thread_sanitizer) || __has_feature(address_sanitizer) || __has_feature(memory_sanitizer)
+#define OX_CHILD_COPIES_MEMORY 1
+#endif
+#endif
+
+#ifdef OX_CHILD_COPIES_MEMORY
+pid_t StartChild(const oxChildPlan& plan) {
+    const pid_t child = fork();
+    if (child == 0)
+        RunChild(plan);
+    return child;
+}
+#else
+// As fork, but the child runs in the memory of this process, on a stack of its own, and this thread sleeps until the
+// program starts: copying the tables of that memory, and copying pages that other threads write to meanwhile, costs a
+// fifth of what a small script does. `RunChild` touches nothing but its stack and the plan.
+pid_t StartChild(const oxChildPlan& plan) {
+    constexpr std::size_t STACK_BYTES = std::size_t{64} * 1024;
+    alignas(64) std::array<char, STACK_BYTES> stack;
+    const auto run = [](void* argument) -> int { RunChild(*static_cast<const oxChildPlan*>(argument)); };
+    return clone(run, stack.data() + stack.size(), CLONE_VM | CLONE_VFORK | SIGCHLD, const_cast<oxChildPlan*>(&plan));
+}
+#endif
 
 // Between the fork and the start of the program no handler of the server's may run in the child.
 class SignalsHeld {
@@ -108,9 +138,7 @@ int oxProc::Spawn(const char* program, const char* arguments, const char* direct
     int error = 0;
     {
         const SignalsHeld held;
-        child = fork();
-        if (child == 0)
-            RunChild(plan);
+        child = StartChild(plan);
         error = errno;
     }
     if (child < 0) {

@@ -1,4 +1,4 @@
-// The child's side of oxProc: what runs between the fork and the start of the program.
+// The child's side of oxProc: what runs until the program starts.
 #pragma once
 
 #include <sys/resource.h>
@@ -23,7 +23,7 @@ struct oxChildPlan {
     pid_t parent = 0;
 };
 
-// Becomes the program, or says on standard error why it cannot, and ends the process with the error number. The forked
-// copy has one thread and whatever locks the others held: only system calls are made here, nothing is allocated or
-// printed through a stream. Expects all signals blocked.
+// Becomes the program, or says on standard error why it cannot, and ends the process with the error number. The child
+// has one thread, perhaps in the memory of its parent, whose other threads run on and hold whatever locks they hold: only
+// system calls are made here, nothing is allocated, written to or printed through a stream. Expects all signals blocked.
 [[noreturn]] void RunChild(const oxChildPlan& plan) noexcept;

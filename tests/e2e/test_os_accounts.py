@@ -6,35 +6,66 @@ import re
 import pytest
 
 from accounts import HASHES, expect_failures, failure_lines, login_lines, needs_namespace, needs_pam
-from harness import BANNER, DEBUG_NOTICE, basic, process_status
+from harness import BANNER, DEBUG_NOTICE, basic, is_listening, process_status, wait_until
 
+RESET = 16
 ROOT_NEEDED = "O/S authentication requires starting the program with root access."
 
 
 # --------------------------------------------------------------------------------------------- the right to do it
 
 
-@pytest.mark.parametrize("command", ["-debug"])
-def test_an_ordinary_user_cannot_start_it(site, command):
+@pytest.mark.parametrize("error_log", ["ox_remote.err", "other.err"])
+@pytest.mark.parametrize("command", ["-debug", pytest.param("-start", marks=pytest.mark.daemon)])
+def test_an_ordinary_user_cannot_start_it(site, command, error_log):
+    """The pointer to the error log is a fixed text."""
     site.use_ordinary_user()
-    site.configure(web={"OSAuthentication": 1}, audit={"debuglevel": 3})
+    site.configure(web={"OSAuthentication": 1, "WebErrorLog": error_log}, audit={"debuglevel": 3})
     site.add_user("alice")
     code, out = site.run(command)
-    assert code == 1
     lines = [
         "Error: The remote interface server failed to initialize.",
         'Refer to "ox_remote.err" for more information.',
     ]
-    assert out == BANNER + DEBUG_NOTICE + f"Changing dir to {site.root};\n" * ("Changing" in out) + "".join(
-        f"{line}\n" for line in lines
-    )
+    if command == "-debug":
+        assert code == 1
+        assert out == BANNER + DEBUG_NOTICE + f"Changing dir to {site.root};\n" * ("Changing" in out) + "".join(
+            f"{line}\n" for line in lines
+        )
+    wait_until(lambda: lines[-1] in site.status(), "the lines of the failed start")
+    wait_until(lambda: not site.leftover_processes(), "the end of the server")
     assert site.err()[-1] == ROOT_NEEDED
-    assert site.error_log.read_text().endswith(ROOT_NEEDED + "\n")
+    assert site.error_log.name == error_log
+    assert site.error_log.read_text().endswith(": " + ROOT_NEEDED + "\n")
+    assert [path.name for path in site.root.glob("*.err")] == [error_log]
     assert not any(line.startswith("Starting server") for line in site.err())
     assert not site.pid_file.exists()
     site.expect("err", re.escape(ROOT_NEEDED), times=1)
     for line in lines:
         site.expect("status", re.escape(line), times=1)
+
+
+@pytest.mark.parametrize("error_log", ["ox_remote.err", "other.err"])
+def test_a_reset_of_an_ordinary_user_to_it_leaves_the_server_stopped_and_waiting(site, error_log):
+    site.use_ordinary_user()
+    site.configure(web={"WebErrorLog": error_log})
+    site.add_user("alice")
+    site.page("deep/page.htm", b"a deep page\n")
+    server = site.serve()
+    assert site.get("/deep/page.htm", basic("alice", "secret")).status == 200
+    site.configure(web={"OSAuthentication": 1})
+    server.signal(RESET)
+    wait_until(lambda: ROOT_NEEDED in site.err(), "the line of the failed reset")
+    assert site.error_log.read_text().endswith(": " + ROOT_NEEDED + "\n")
+    site.run("-status")
+    stopped = "Remote interface server is stopped."
+    wait_until(lambda: stopped in site.status(), "the answer of the stopped server")
+    assert server.alive() and not is_listening(site.port)
+    site.configure(web={"OSAuthentication": 0})
+    server.reset()
+    assert site.get("/deep/page.htm", basic("alice", "secret")).status == 200
+    site.expect("err", re.escape(ROOT_NEEDED), times=1)
+    site.expect("status", re.escape(stopped), times=1)
 
 
 def test_without_error_logging_the_refusal_leaves_no_file(site):
@@ -259,6 +290,37 @@ def test_a_domain_in_the_settings_is_put_in_front(machine):
     assert not machine.login("HOME\\both", "in shadow")
     assert not machine.login("OFFICE/shadowed", "in shadow"), "there is no user of that name"
     expect_failures(site, "shadowed", "HOME\\both")
+
+
+@needs_namespace
+@needs_pam
+def test_a_reset_takes_a_changed_domain(machine):
+    site = machine.site
+    site.add_user("HOME\\both", "unused", file="1.usr")
+    server = machine.serve()
+    for turn, (domain, account) in enumerate([(None, "both"), ("OFFICE", "HOME\\both"), ("", "both")]):
+        if turn > 0:
+            site.configure(web={"NTAuthenticationDomain": domain})
+            server.reset()
+        assert machine.login("HOME\\both", "in shadow") == (account == "both")
+    expect_failures(site, "HOME\\both")
+
+
+@needs_namespace
+@needs_pam
+def test_a_reset_takes_who_proves_the_password(machine):
+    """The accounts or the user files; what was remembered by the other rule counts no more."""
+    site = machine.site
+    site.add_user("shadowed", "in the file")
+    site.configure(web={"OSAuthentication": 0})
+    server = machine.serve()
+    for turn, value in enumerate((0, 1, 0)):
+        if turn > 0:
+            site.configure(web={"OSAuthentication": value})
+            server.reset()
+        assert machine.login("shadowed", "in shadow") == (value == 1)
+        assert machine.login("shadowed", "in the file") == (value == 0)
+    expect_failures(site, "shadowed")
 
 
 @needs_namespace

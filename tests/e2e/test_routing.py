@@ -191,7 +191,7 @@ def test_an_absent_main_settings_file_is_named_and_refuses_the_reports(site):
     line = f"Unable to open the log analysis configuration file, {site.main_ini}."
     assert site.err().count(line) == 1
     site.expect("err", re.escape(line), times=1)
-    assert fetch(site, "/reports/sales/x.htm", CHIEF) == b"the report\n"
+    assert [fetch(site, "/reports/sales/x.htm", user) for user in (ALICE, CHIEF)] == [403, b"the report\n"]
     assert fetch(site, "/top.htm") == b"top\n"
     site.main_ini.write_text(text)
     server.reset()
@@ -204,6 +204,35 @@ def test_a_reset_takes_another_directory_of_profiles(site):
     site.add_profile("sales.wlp", "bob", directory="others")
     server.reset()
     assert [fetch(site, "/reports/sales/x.htm", user) for user in (ALICE, BOB)] == [403, b"the report\n"]
+
+
+@pytest.mark.parametrize("value", [None, "", "./absent", "./ox_remote.ini"], ids=["unset", "empty", "missing", "file"])
+def test_a_reset_that_finds_no_profiles_takes_the_reports_away(site, value):
+    """From users without bit 0; their logins stay good."""
+    server = site.serve()
+    assert [fetch(site, "/reports/sales/x.htm", user) for user in (ALICE, CHIEF)] == [b"the report\n"] * 2
+    text = site.main_ini.read_text()
+    setting = "" if value is None else f"profilesdir={value}\n"
+    site.main_ini.write_text(f"[interface]\nersaddress=127.0.0.1:1\n[defaults]\n{setting}")
+    server.reset()
+    assert [fetch(site, "/reports/sales/x.htm", user) for user in (ALICE, CHIEF)] == [403, b"the report\n"]
+    assert fetch(site, "/deep/page.htm", ALICE) == PLACES["wwwroot/deep/page.htm"]
+    site.main_ini.write_text(text)
+    server.reset()
+    assert [fetch(site, "/reports/sales/x.htm", user) for user in (ALICE, CHIEF)] == [b"the report\n"] * 2
+
+
+def test_a_reset_with_an_unreadable_main_settings_file_takes_the_reports_away(site):
+    site.use_ordinary_user()
+    server = site.serve()
+    assert [fetch(site, "/reports/sales/x.htm", user) for user in (ALICE, CHIEF)] == [b"the report\n"] * 2
+    site.main_ini.chmod(0)
+    server.reset()
+    assert [fetch(site, "/reports/sales/x.htm", user) for user in (ALICE, CHIEF)] == [403, b"the report\n"]
+    site.expect("err", re.escape(f"Unable to open the log analysis configuration file, {site.main_ini}."), times=1)
+    site.main_ini.chmod(0o644)
+    server.reset()
+    assert fetch(site, "/reports/sales/x.htm", ALICE) == b"the report\n"
 
 
 @pytest.mark.parametrize("kind", ["unset", "empty", "missing", "file", "no-profiles"])

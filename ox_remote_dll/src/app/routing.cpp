@@ -6,7 +6,7 @@
 #include "app/oxxhttpserver.h"
 #include "app/scriptarguments.h"
 #include "app/urlpath.h"
-#include "platform/filename.h"
+#include "platform/text.h"
 #include "protocol/http.h"
 #include "resources/staticfile.h"
 #include "support/logtext.h"
@@ -16,7 +16,6 @@ namespace {
 
 constexpr int SECONDS_PER_MINUTE = 60;
 constexpr int DECIMAL = 10;
-constexpr unsigned char DELETE = 0x7f;
 
 // A user name in the parameters of a script: what would end the pair or the engine's argument is escaped. New users
 // cannot have such names; files that were made by hand can.
@@ -25,7 +24,7 @@ std::string EscapeName(const std::string& name) {
     std::string escaped;
     for (const char c : name) {
         const auto byte = static_cast<unsigned char>(c);
-        if (byte <= ' ' || byte == DELETE || std::string_view("&=%+").find(c) != std::string_view::npos)
+        if (IsControl(c) || std::string_view(" &=%+").find(c) != std::string_view::npos)
             escaped.append({'%', DIGITS[byte >> 4], DIGITS[byte & 0xf]});
         else
             escaped.push_back(c);

@@ -8,10 +8,10 @@
 #include <utility>
 
 #include "app/urltext.h"
+#include "platform/text.h"
 
 namespace {
 
-constexpr unsigned char DELETE = 0x7f;
 constexpr std::string_view BLANKS = " \t\n\v\f\r";
 
 enum class Kind { Text, Line, Number };
@@ -27,11 +27,6 @@ constexpr KnownKey KNOWN_KEYS[] = {
     {oxScriptArguments::KEY_LOGFILEURL, Kind::Line},    {oxScriptArguments::KEY_PROFILE_ID, Kind::Text},
     {oxScriptArguments::KEY_DECODE, Kind::Text},
 };
-
-bool IsControl(char c) {
-    const auto byte = static_cast<unsigned char>(c);
-    return byte < ' ' || byte == DELETE;
-}
 
 // As strtol reads it, but nothing may follow the number.
 std::optional<int> ParseNumber(std::string_view text) {

@@ -28,8 +28,6 @@ enum Command {
     DECRYPT = 71
 };
 
-constexpr unsigned char DELETE = 0x7f;
-
 int Status(bool done) {
     return done ? oxxHttpServer::COMMAND_DONE : oxxHttpServer::COMMAND_FAILED;
 }
@@ -116,10 +114,7 @@ int Serve(int command, const std::string& raw, char* reply, std::size_t replySiz
 
 // Fields of the remote service's request are separated by "|" and nothing is escaped.
 bool IsForwardable(std::string_view contextString) {
-    return std::none_of(contextString.begin(), contextString.end(), [](char c) {
-        const auto byte = static_cast<unsigned char>(c);
-        return c == '|' || byte < ' ' || byte == DELETE;
-    });
+    return std::none_of(contextString.begin(), contextString.end(), [](char c) { return c == '|' || IsControl(c); });
 }
 
 }  // namespace

@@ -2,10 +2,10 @@
 
 #include <algorithm>
 
+#include "platform/text.h"
+
 namespace {
 constexpr std::string_view CLIMB = "../";
-constexpr unsigned char BLANK = ' ';
-constexpr unsigned char DELETE = 0x7f;
 }  // namespace
 
 bool oxUrlPath::Climbs() const {
@@ -37,8 +37,5 @@ std::string_view oxUrlPath::BehindFirst() const {
 }
 
 bool oxUrlPath::FitsCommandLine() const {
-    return std::none_of(m_path.begin(), m_path.end(), [](char c) {
-        const auto byte = static_cast<unsigned char>(c);
-        return byte <= BLANK || byte == DELETE;
-    });
+    return std::none_of(m_path.begin(), m_path.end(), [](char c) { return c == ' ' || IsControl(c); });
 }

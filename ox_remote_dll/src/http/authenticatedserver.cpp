@@ -4,22 +4,12 @@
 
 #include <algorithm>
 #include <mutex>
-#include <string_view>
 #include <utility>
 
+#include "platform/encrypt.h"
 #include "platform/rootguard.h"
 
 namespace {
-
-// Takes the same time wherever the first difference lies.
-bool IsSameSecret(std::string_view one, std::string_view other) {
-    if (one.size() != other.size())
-        return false;
-    volatile unsigned difference = 0;
-    for (std::size_t i = 0; i < one.size(); ++i)
-        difference = difference | (static_cast<unsigned char>(one[i]) ^ static_cast<unsigned char>(other[i]));
-    return difference == 0;
-}
 
 bool CanBecomeRoot() {
     const RootGuard root;
@@ -129,7 +119,7 @@ oxAuthenticatedHttpServer::Memory oxAuthenticatedHttpServer::LookUp(const std::s
                                                                     std::uint32_t& permissions) {
     const std::scoped_lock lock(m_userLock);
     const auto found = m_users.find(name);
-    if (found == m_users.end() || !IsSameSecret(found->second.user->GetPassword(), password))
+    if (found == m_users.end() || !EqualSecrets(found->second.user->GetPassword(), password))
         return Memory::None;
     // One that another request has checked against newer data than this request knows of is good too.
     if (found->second.generation < generation)

@@ -16,29 +16,16 @@
 #include <string_view>
 
 #include "platform/file.h"
+#include "platform/identitycalls.h"
 
 namespace {
 constexpr const char* SOURCE = "./ox_remote_dll/src/proc";
 constexpr int SETUID_LINE = 553;  // fixed, as the path: known to those who read the status log
-constexpr uid_t ROOT = 0;
-constexpr uid_t UNCHANGED = static_cast<uid_t>(-1);
 constexpr mode_t CHILD_MASK = 022;
 constexpr int LAST_SIGNAL = 64;
 constexpr std::size_t KERNEL_MASK_BYTES = 8;
 // Enough for the longest path that the system takes and the words around it.
 constexpr std::size_t MESSAGE_BYTES = PATH_MAX + 256;
-
-// The raw calls change the calling thread, here the only one. The C library's would talk to threads that the fork did
-// not copy.
-#ifdef SYS_setresuid32
-constexpr long SET_USERS_CALL = SYS_setresuid32;  // the others take 16-bit ids there
-constexpr long SET_GROUPS_CALL = SYS_setresgid32;
-constexpr long SET_GROUP_LIST_CALL = SYS_setgroups32;
-#else
-constexpr long SET_USERS_CALL = SYS_setresuid;
-constexpr long SET_GROUPS_CALL = SYS_setresgid;
-constexpr long SET_GROUP_LIST_CALL = SYS_setgroups;
-#endif
 
 // Nice values of the priorities 1 to 10; the entry of 0 and that of the unchanged one are not used.
 constexpr std::array<int, 11> NICE = {0, 19, 16, 12, 8, 4, 0, -5, -10, -15, -20};
@@ -87,10 +74,10 @@ bool SetUsers(uid_t real, uid_t effective, uid_t saved) {
 template <typename Body>
 void AsRoot(Body body) {
     const uid_t user = geteuid();
-    const bool raised = user != ROOT && SetUsers(UNCHANGED, ROOT, UNCHANGED);
+    const bool raised = user != ROOT_USER && SetUsers(UNCHANGED_USER, ROOT_USER, UNCHANGED_USER);
     body();
     // No program is started with more than it was to have.
-    if (raised && !SetUsers(UNCHANGED, user, UNCHANGED))
+    if (raised && !SetUsers(UNCHANGED_USER, user, UNCHANGED_USER))
         EndWithIdentityKept(errno);
 }
 
@@ -163,9 +150,9 @@ void RestoreFileLimit(const rlimit* limit) {
 void GiveUpRoot() {
     const uid_t user = geteuid();
     const gid_t group = getegid();
-    if (getuid() != ROOT || user == ROOT)
+    if (getuid() != ROOT_USER || user == ROOT_USER)
         return;
-    if (!SetUsers(UNCHANGED, ROOT, UNCHANGED) || syscall(SET_GROUP_LIST_CALL, 0, nullptr) != 0 ||
+    if (!SetUsers(UNCHANGED_USER, ROOT_USER, UNCHANGED_USER) || syscall(SET_GROUP_LIST_CALL, 0, nullptr) != 0 ||
         syscall(SET_GROUPS_CALL, group, group, group) != 0 || !SetUsers(user, user, user))
         EndWithIdentityKept(errno);
 }
@@ -183,7 +170,7 @@ void ChangeDirectory(const char* directory) {
 
 void BecomeRealUser() {
     const uid_t user = getuid();
-    if (SetUsers(UNCHANGED, user, UNCHANGED))
+    if (SetUsers(UNCHANGED_USER, user, UNCHANGED_USER))
         return;
     const int error = errno;
     ChildMessage message;

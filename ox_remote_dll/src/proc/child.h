@@ -24,6 +24,7 @@ struct oxChildPlan {
 };
 
 // Becomes the program, or says on standard error why it cannot, and ends the process with the error number. The child
-// has one thread, perhaps in the memory of its parent, whose other threads run on and hold whatever locks they hold: only
-// system calls are made here, nothing is allocated, written to or printed through a stream. Expects all signals blocked.
+// has one thread, perhaps in the memory of its parent, whose other threads run on and hold whatever locks they hold:
+// only system calls are made here, nothing is allocated, written to or printed through a stream. Expects all signals
+// blocked.
 [[noreturn]] void RunChild(const oxChildPlan& plan) noexcept;

@@ -59,10 +59,6 @@ std::size_t FindTag(std::string_view page, std::string_view tag, std::size_t fro
     return std::string_view::npos;
 }
 
-bool IsControl(char c) {
-    return static_cast<unsigned char>(c) < 0x20 || c == 0x7f;
-}
-
 }  // namespace
 
 void oxReply::ScanForMetaTags(const char* buffer, std::size_t length) {

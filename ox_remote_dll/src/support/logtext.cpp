@@ -1,5 +1,7 @@
 #include "support/logtext.h"
 
+#include "platform/text.h"
+
 namespace {
 std::string Escape(std::string_view text, bool quotes) {
     static constexpr char DIGITS[] = "0123456789abcdef";
@@ -7,7 +9,7 @@ std::string Escape(std::string_view text, bool quotes) {
     safe.reserve(text.size());
     for (const char c : text) {
         const auto byte = static_cast<unsigned char>(c);
-        if (byte < 0x20 || byte == 0x7f || (quotes && c == '"')) {
+        if (IsControl(c) || (quotes && c == '"')) {
             safe += "\\x";
             safe += DIGITS[byte >> 4];
             safe += DIGITS[byte & 15];

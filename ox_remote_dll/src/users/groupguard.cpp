@@ -2,7 +2,6 @@
 
 #include <dlfcn.h>
 #include <grp.h>
-#include <sys/syscall.h>
 #include <unistd.h>
 
 #include <algorithm>
@@ -12,19 +11,14 @@
 #include <string_view>
 
 #include "platform/file.h"
+#include "platform/identitycalls.h"
 
 namespace {
-
-#ifdef SYS_setgroups32
-constexpr long SET_GROUPS_CALL = SYS_setgroups32;  // the other one takes 16-bit ids there
-#else
-constexpr long SET_GROUPS_CALL = SYS_setgroups;
-#endif
 
 thread_local bool t_thisThreadOnly = false;
 
 int SetThreadGroups(std::size_t count, const gid_t* groups) {
-    return static_cast<int>(syscall(SET_GROUPS_CALL, count, groups));
+    return static_cast<int>(syscall(SET_GROUP_LIST_CALL, count, groups));
 }
 
 std::vector<gid_t> ThreadGroups() {

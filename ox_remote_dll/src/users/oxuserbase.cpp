@@ -9,6 +9,7 @@
 #include <vector>
 
 #include "platform/encrypt.h"
+#include "platform/text.h"
 #include "users/keyvaluemap.h"
 
 namespace {
@@ -16,11 +17,7 @@ namespace {
 constexpr const char* ANONYMOUS = "anonymous";
 
 bool HasControls(const std::string& text) {
-    constexpr unsigned char DELETE = 0x7F;
-    return std::any_of(text.begin(), text.end(), [](char c) {
-        const auto byte = static_cast<unsigned char>(c);
-        return byte < ' ' || byte == DELETE;
-    });
+    return std::any_of(text.begin(), text.end(), IsControl);
 }
 
 // What a browser can send (a colon ends the name), what the texts for scripts can carry, and what a settings file gives

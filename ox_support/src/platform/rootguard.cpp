@@ -1,6 +1,5 @@
 #include "platform/rootguard.h"
 
-#include <sys/syscall.h>
 #include <unistd.h>
 
 #include <cerrno>
@@ -8,35 +7,27 @@
 #include <string_view>
 
 #include "platform/file.h"
+#include "platform/identitycalls.h"
 
 namespace {
 
-#ifdef SYS_setresuid32
-constexpr long SET_IDS_CALL = SYS_setresuid32;  // the other one takes 16-bit ids there
-#else
-constexpr long SET_IDS_CALL = SYS_setresuid;
-#endif
-
-constexpr uid_t ROOT = 0;
-constexpr uid_t UNCHANGED = static_cast<uid_t>(-1);
-
 // 0 or the error number.
 int SetThreadEffectiveUser(uid_t user) {
-    return syscall(SET_IDS_CALL, UNCHANGED, user, UNCHANGED) == 0 ? 0 : errno;
+    return syscall(SET_USERS_CALL, UNCHANGED_USER, user, UNCHANGED_USER) == 0 ? 0 : errno;
 }
 
 }  // namespace
 
 RootGuard::RootGuard() : m_previous(geteuid()) {
-    if (m_previous == ROOT)
+    if (m_previous == ROOT_USER)
         return;
     const int savedError = errno;
-    m_error = SetThreadEffectiveUser(ROOT);
+    m_error = SetThreadEffectiveUser(ROOT_USER);
     errno = savedError;
 }
 
 RootGuard::~RootGuard() {
-    if (m_keep || m_error != 0 || m_previous == ROOT)
+    if (m_keep || m_error != 0 || m_previous == ROOT_USER)
         return;
     const int savedError = errno;
     if (SetThreadEffectiveUser(m_previous) != 0) {

@@ -6,6 +6,11 @@
 #include <cstdio>
 #include <cstring>
 
+bool IsControl(char c) {
+    constexpr char DELETE = 0x7f;
+    return static_cast<unsigned char>(c) < ' ' || c == DELETE;
+}
+
 char ToLower(char c) {
     return c >= 'A' && c <= 'Z' ? static_cast<char>(c - 'A' + 'a') : c;
 }

@@ -12,6 +12,9 @@ std::string ToLower(std::string_view text);
 bool EqualNoCase(std::string_view a, std::string_view b);
 bool StartsWithNoCase(std::string_view text, std::string_view prefix);
 
+// An ASCII control character: below the blank, or DEL.
+bool IsControl(char c);
+
 // Signed, with lower-case digits. The radix is 2 to 36; any other gives the empty text.
 std::string IntToText(std::int64_t value, int radix = 10);
 

@@ -1,5 +1,6 @@
 // The client of the remote service, against services that answer well, badly, late or not at all.
 #include <fcntl.h>
+#include <netinet/tcp.h>
 #include <sys/resource.h>
 
 #include <algorithm>
@@ -367,6 +368,24 @@ TEST_F(RemoteService, LargeRequestGoesOutWhole) {
     EXPECT_EQ("0|done", Ask("ctx", 1, argument));
     ASSERT_EQ(1u, service.Requests().size());
     EXPECT_TRUE("ctx|1|" + argument + "|EOT" == service.Requests()[0]);
+}
+
+TEST_F(RemoteService, ConnectionSendsAtOnceAndMayReuseItsAddress) {
+    static int s_noDelay = 0;
+    static int s_reuse = 0;
+    s_noDelay = s_reuse = 0;
+    const Replaced connect(
+        oxSocket::m_lpfnconnect, +[](int socket, const sockaddr* address, socklen_t length) {
+            socklen_t size = sizeof s_noDelay;
+            EXPECT_EQ(0, ::getsockopt(socket, IPPROTO_TCP, TCP_NODELAY, &s_noDelay, &size));
+            EXPECT_EQ(0, ::getsockopt(socket, SOL_SOCKET, SO_REUSEADDR, &s_reuse, &size));
+            return ::connect(socket, address, length);
+        });
+    FakeService service("0|done|EOT");
+    UseService(service.Address());
+    EXPECT_EQ("0|done", Ask());
+    EXPECT_NE(0, s_noDelay);
+    EXPECT_NE(0, s_reuse);
 }
 
 TEST_F(RemoteService, ServiceThatAnswersWithoutReadingIsHeard) {

@@ -3,6 +3,7 @@
 #include <pthread.h>
 #include <sys/types.h>
 
+#include <atomic>
 #include <cerrno>
 #include <cstdarg>
 
@@ -15,6 +16,7 @@ struct Plan {
     int passing = 0;
 };
 thread_local Plan plan;
+std::atomic<long> waitPidCalls{0};
 
 // The error number, or 0 when the call is to pass.
 int Error(FailingCall call, long systemCall = 0) {
@@ -35,6 +37,10 @@ FailsOnce::~FailsOnce() {
 
 bool FailsOnce::HasFailed() {
     return !plan.active;
+}
+
+long WaitPidCalls() {
+    return waitPidCalls;
 }
 
 extern "C" {
@@ -83,6 +89,7 @@ int __wrap_pthread_cond_broadcast(pthread_cond_t* condition) {
 }
 
 pid_t __wrap_waitpid(pid_t pid, int* status, int options) {
+    ++waitPidCalls;
     if (const int error = Error(FailingCall::WaitPid); error != 0) {
         errno = error;
         return -1;

@@ -29,3 +29,6 @@ public:
 private:
     FailsOnce(FailingCall call, long systemCall, int error, int passing);
 };
+
+// How often any thread has called waitpid.
+long WaitPidCalls();

@@ -103,3 +103,8 @@ TEST(Text, GetLastErrorText) {
     EXPECT_STREQ("Unknown error -1", GetLastErrorText(-1));
     EXPECT_STREQ("Unknown error -2147483648", GetLastErrorText(std::numeric_limits<int>::min()));
 }
+
+TEST(Text, ControlCharactersAreThoseBelowTheBlankAndDelete) {
+    for (int byte = 0; byte < 256; ++byte)
+        EXPECT_EQ(IsControl(static_cast<char>(byte)), byte < 32 || byte == 127) << byte;
+}

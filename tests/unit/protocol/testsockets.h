@@ -12,6 +12,7 @@
 
 #include <cstdarg>
 #include <cstdio>
+#include <mutex>
 #include <stdexcept>
 #include <string>
 #include <string_view>
@@ -96,8 +97,9 @@ public:
     }
 
 private:
-    // The only way into an oxSocket for a descriptor that is open already.
+    // The only way into an oxSocket for a descriptor that is open already. The entry is every thread's.
     void Adopt(int descriptor, int family, int type) {
+        const std::scoped_lock lock(s_adopting);
         s_prepared = descriptor;
         const auto kept = oxSocket::m_lpfnsocket;
         oxSocket::m_lpfnsocket = [](int, int, int) { return s_prepared; };
@@ -126,6 +128,7 @@ private:
         Adopt(::accept4(listener.Get(), nullptr, nullptr, SOCK_CLOEXEC), AF_INET, SOCK_STREAM);
     }
 
+    static inline std::mutex s_adopting;
     static inline int s_prepared = -1;
     oxSocket m_server;
     UniqueFd m_peer;

@@ -1,7 +1,9 @@
 // Ends of children that are hard to take: without memory, or with a debugger in between.
 #include <gtest/gtest.h>
 
+#include <cerrno>
 #include <chrono>
+#include <cstdlib>
 #include <cstring>
 #include <new>
 #include <string>
@@ -28,9 +30,8 @@ bool IsZombie(int pid) {
 
 class ReapingOfEngines : public ScriptRun {
 protected:
-    // Runs the moves in a forked copy with a callback that fails for want of memory, which lasts until the run is
-    // left. With an argument it waits for the end of the engine
-    // first.
+    // Runs the moves in a forked copy with a callback that fails for want of memory, which lasts until the run is left.
+    // With an argument the callback waits for the end of the engine first.
     int RunWithoutMemory(const std::string& moves) const {
         return InForkedCopy([&] {
             const auto fail = [](void*, const char*, int, char* argumentText, int*) -> const char* {
@@ -64,7 +65,6 @@ protected:
     };
     Looks PlayTraced(const std::string& moves) {
         Looks looks{-100, 0, 0};
-        const std::string go = m_home.File("go");
         m_home.Files().Write("script.out", "");
         std::thread run([&] { looks.result = Play("status\ntouch " + m_home.File("ready") + "\n" + moves).result; });
         EXPECT_TRUE(Eventually([&] { return access(m_home.File("ready").c_str(), F_OK) == 0; }));

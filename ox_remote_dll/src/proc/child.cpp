@@ -146,13 +146,16 @@ void RestoreFileLimit(const rlimit* limit) {
     setrlimit(RLIMIT_NOFILE, &now);
 }
 
-// A real or saved id of root would let the program become root whenever it likes; shells and perl do by themselves.
-void GiveUpRoot() {
+// A real or saved id of root would let the program become root whenever it likes; shells and perl do by themselves. Any
+// other real id that differs (a set-uid start) would put perl under its rules for tainted data.
+void TakeEffectiveUserForGood() {
     const uid_t user = geteuid();
     const gid_t group = getegid();
-    if (getuid() != ROOT_USER || user == ROOT_USER)
+    if (user == ROOT_USER || getuid() == user)
         return;
-    if (!SetUsers(UNCHANGED_USER, ROOT_USER, UNCHANGED_USER) || syscall(SET_GROUP_LIST_CALL, 0, nullptr) != 0 ||
+    const bool wasRoot = getuid() == ROOT_USER;
+    const bool raised = SetUsers(UNCHANGED_USER, ROOT_USER, UNCHANGED_USER);
+    if ((wasRoot && !raised) || (raised && syscall(SET_GROUP_LIST_CALL, 0, nullptr) != 0) ||
         syscall(SET_GROUPS_CALL, group, group, group) != 0 || !SetUsers(user, user, user))
         EndWithIdentityKept(errno);
 }
@@ -177,6 +180,11 @@ void BecomeRealUser() {
     message << SOURCE << " " << SETUID_LINE << " - setuid(" << static_cast<int>(user) << "): ";
     message.Error(error);
     message.Write();
+}
+
+// What a service manager gave the server beyond its user's rights (low ports, say) is not for programs that it runs.
+void DropAmbientCapabilities() {
+    prctl(PR_CAP_AMBIENT, PR_CAP_AMBIENT_CLEAR_ALL, 0, 0, 0);
 }
 
 // After the last change of ids, which takes it back. The server may have ended before.
@@ -204,10 +212,11 @@ void RunChild(const oxChildPlan& plan) noexcept {
     CloseInherited();
     RestoreFileLimit(plan.fileLimit);
     if (!plan.runAsRealUser)
-        GiveUpRoot();
+        TakeEffectiveUserForGood();
     ChangeDirectory(plan.directory);
     if (plan.runAsRealUser)
         BecomeRealUser();
+    DropAmbientCapabilities();
     umask(CHILD_MASK);
     DieWithParent(plan.parent);
     ResetSignals();

@@ -1,6 +1,7 @@
 #include "proc/child.h"
 
 #include <gtest/gtest.h>
+#include <linux/capability.h>
 #include <signal.h>
 #include <sys/prctl.h>
 #include <sys/stat.h>
@@ -243,7 +244,7 @@ TEST(OxProcChild, RootIsGivenUpForGoodUnlessTheRealUserIsWanted) {
         {0, USER, 0, 2, "1 1 1 1", "1 1 1 1", ""},       {0, USER, 0, 1, "0 0 0 0", "0 1 1 1", "0 4 24"},
         {0, 0, 0, 0, "0 0 0 0", "0 0 0 0", "0 4 24"},    {0, 0, 0, 1, "0 0 0 0", "0 0 0 0", "0 4 24"},
         {USER, 0, 0, 0, "1 0 0 0", "0 0 0 0", "0 4 24"}, {USER, 0, 0, 1, "1 1 1 1", "0 0 0 0", "0 4 24"},
-        {USER, 2, 2, 0, "1 2 2 2", "0 2 2 2", "0 4 24"}, {USER, 2, 2, 1, "1 1 1 1", "0 2 2 2", "0 4 24"},
+        {USER, 2, 2, 0, "2 2 2 2", "2 2 2 2", "0 4 24"}, {USER, 2, 2, 1, "1 1 1 1", "0 2 2 2", "0 4 24"},
     };
     for (const auto& row : rows) {
         SCOPED_TRACE(std::to_string(row.real) + " " + std::to_string(row.effective) + " flag " +
@@ -258,6 +259,21 @@ TEST(OxProcChild, RootIsGivenUpForGoodUnlessTheRealUserIsWanted) {
         });
     }
     EXPECT_EQ(0u, geteuid());
+}
+
+TEST(OxProcChild, AmbientCapabilitiesStayWithTheServer) {
+    SKIP_UNLESS_ROOT();
+    std::thread([] {
+        __user_cap_header_struct header{_LINUX_CAPABILITY_VERSION_3, 0};
+        __user_cap_data_struct sets[_LINUX_CAPABILITY_U32S_3] = {};
+        ASSERT_EQ(0, syscall(SYS_capget, &header, sets));
+        sets[0].inheritable |= 1U << CAP_NET_BIND_SERVICE;
+        if (syscall(SYS_capset, &header, sets) != 0 ||
+            prctl(PR_CAP_AMBIENT, PR_CAP_AMBIENT_RAISE, CAP_NET_BIND_SERVICE, 0, 0) != 0)
+            GTEST_SKIP() << "may not hand capabilities on";
+        oxProc proc;
+        EXPECT_EQ("0000000000000000", StatusLine(OwnStatus(proc), "CapAmb"));
+    }).join();
 }
 
 TEST(OxProcChild, AnOrdinaryUserStaysWhatHeIs) {

@@ -5,6 +5,7 @@
 
 #include "app/urlpath.h"
 #include "platform/config.h"
+#include "platform/encrypt.h"
 #include "platform/filename.h"
 #include "support/logtext.h"
 
@@ -50,6 +51,7 @@ void oxxHttpServer::SetUp(const oxConfig& config, const char* section, const oxH
     if (!oxUrlPath(setup->homeDirectory).FitsCommandLine())
         MessageLog().Error("Scripts cannot run: the directory name \"%s\" has a blank or control character in it.",
                            LogText(setup->homeDirectory).c_str());
+    ForgetEncryptionKey();
     // Requests that outlive a reset meet the new users under the stricter of the two rules: where accounts prove the
     // password, a user file needs none.
     const bool stricter = setup->osAuthentication;

@@ -126,13 +126,25 @@ std::optional<Key> TheKey(WhenMissing missing) {
     return state.key;
 }
 
+void Forget(State& state) {
+    if (state.key)
+        sodium_memzero(state.key->data(), state.key->size());
+    state.key.reset();
+}
+
 }  // namespace
 
 void SetEncryptionKeyFile(const std::string& path) {
     State& state = TheState();
     const std::scoped_lock lock(state.mutex);
     state.path = path;
-    state.key.reset();
+    Forget(state);
+}
+
+void ForgetEncryptionKey() {
+    State& state = TheState();
+    const std::scoped_lock lock(state.mutex);
+    Forget(state);
 }
 
 bool oxEncrypt(std::string_view clear, std::string& sealed) {

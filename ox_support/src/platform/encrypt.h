@@ -9,6 +9,8 @@
 // file is named.
 inline constexpr const char* DEFAULT_ENCRYPTION_KEY_FILE = "./oxm_oxx/datfiles/ox_remote.key";
 void SetEncryptionKeyFile(const std::string& path);
+// The next use reads the file again: it may have been restored.
+void ForgetEncryptionKey();
 
 // Seals a text of any bytes. Two sealings of one text differ. The result is made of letters, digits, "-" and "_" only,
 // so it can stand in settings files, URLs and key/value texts as it is. False, and an empty text, when there is no key

@@ -193,6 +193,22 @@ TEST_F(Encrypt, TheKeyIsKeptUntilAFileIsNamed) {
     ExpectOpens("secret", sealed);
 }
 
+TEST_F(Encrypt, AForgottenKeyIsReadAgain) {
+    std::string sealed;
+    std::string clear;
+    ASSERT_TRUE(oxEncrypt("secret", sealed));
+    const std::string key = m_scratch.Read("keys/ox_remote.key");
+    m_scratch.Write("keys/ox_remote.key", std::string(KEY_BYTES, 'k'));
+    EXPECT_TRUE(oxDecrypt(sealed, clear)) << "kept";
+    ForgetEncryptionKey();
+    EXPECT_FALSE(oxDecrypt(sealed, clear));
+    m_scratch.Write("keys/ox_remote.key", key);
+    EXPECT_FALSE(oxDecrypt(sealed, clear));
+    ForgetEncryptionKey();
+    EXPECT_TRUE(oxDecrypt(sealed, clear));
+    EXPECT_EQ(clear, "secret");
+}
+
 TEST_F(Encrypt, AnotherKeyOpensNothing) {
     const std::string sealed = Sealed("secret");
     SetEncryptionKeyFile(m_scratch.File("keys/other.key"));

@@ -47,15 +47,12 @@ print "Content-Type: text/html\\r\\n\\r\\n" if $ENV{GATEWAY_INTERFACE};
 print "<html><body>Hello, world: 0123456789</body></html>\\n";
 """
 HELLO_SIZE = 51
-# The smallest scripting engine that can run it: the page goes to the file that the server names.
+# The smallest scripting engine that can run it: the page goes to the file that the server names. Its end is the end of
+# the conversation. It is started by its first line, as the script is by the other servers.
 ENGINE = """\
 #!/usr/bin/perl
-my ($script, $page) = @ARGV[1, 3];
-open my $server, '>&', \\*STDOUT or die $!;
-open STDOUT, '>>', $page or die $!;
-do $script;
-close STDOUT;
-syswrite $server, "EXIT";
+open STDOUT, '>>', $ARGV[3] or die $!;
+do $ARGV[1];
 """
 
 
@@ -83,7 +80,7 @@ SCENARIOS = [
     Scenario("10m", "10 MB file", "/10m.html", 10 * MB, page, stretch=2),
     Scenario("script", "hello-world Perl script", "/hello.pl", HELLO_SIZE, script, only=frozenset(
         {"ox_remote", "lighttpd", "apache"}), extra_config={
-            "lighttpd": 'server.modules += ( "mod_cgi" )\ncgi.assign = ( ".pl" => "/usr/bin/perl" )\n'
+            "lighttpd": 'server.modules += ( "mod_cgi" )\ncgi.assign = ( ".pl" => "" )\n'
                         'static-file.exclude-extensions = ( ".pl" )',
             "apache": "LoadModule cgid_module /usr/lib/apache2/modules/mod_cgid.so\nScriptSock cgisock\n"
                       "AddHandler cgi-script .pl\n<Directory @ROOT@>\nOptions +ExecCGI\n</Directory>"}),

@@ -120,7 +120,6 @@ int oxRemoteScript::Run(int argc, char** argv, void* context, oxScriptCallback c
     struct Release {
         oxRemoteScript& script;
         ~Release() {
-            script.m_run = nullptr;
             currentRun = nullptr;
             script.ReleaseLocks();
         }
@@ -139,7 +138,6 @@ int oxRemoteScript::Run(int argc, char** argv, void* context, oxScriptCallback c
     if (!run.Spawn(m_enginePath, commandLine.c_str()))
         return RESULT_NOT_SPAWNED;
     m_context = context;
-    m_run = &run;
     currentRun = &run;
     run.Serve(data, [&](const char* message, int length) { return Answer(message, length, callback); });
     return run.AwaitEnd();
@@ -239,7 +237,7 @@ bool oxRemoteScript::IsCurrentRunOver() {
 }
 
 bool oxRemoteScript::IsOver() const {
-    return m_run != nullptr ? m_run->IsOver() : m_limits.stop != nullptr && m_limits.stop->load();
+    return currentRun != nullptr ? currentRun->IsOver() : m_limits.stop != nullptr && m_limits.stop->load();
 }
 
 void oxRemoteScript::ReleaseLocks() {

@@ -10,8 +10,6 @@
 
 #include "rwlock.h"
 
-class oxEngineRun;
-
 // Serves one command of the engine: the context that the run was given, the message's first string, the command, the
 // message's second string (may be changed in place) and the status to answer (0 at the call). Never returns null; the
 // text is copied before the next call of the same thread.
@@ -83,7 +81,6 @@ private:
     LockState m_locked = rwUnlocked;
     oxScriptLimits m_limits;
     void* m_context = nullptr;
-    oxEngineRun* m_run = nullptr;  // while Run works
     // What this run holds of the lock; the lock state tells only what its last command did.
     int m_reads = 0;
     bool m_writing = false;

@@ -8,9 +8,6 @@
 // and what the file system opens must be the same component. Refers to the path it is given.
 class oxUrlPath {
 public:
-    static constexpr std::string_view REPORTS = "reports";
-    static constexpr std::string_view CGI_BIN = "cgi-bin";
-
     explicit oxUrlPath(std::string_view path) : m_path(path) {}
 
     // "../" anywhere.

@@ -25,3 +25,9 @@ if(OX_SANITIZE)
     target_compile_options(ox_options INTERFACE -Wno-maybe-uninitialized)
   endif()
 endif()
+
+if(OX_BUILD_FUZZERS)
+  # The libraries report what they run through, else a target searches blindly in everything but its own file.
+  target_compile_options(ox_options INTERFACE -fsanitize=fuzzer-no-link)
+  target_link_options(ox_options INTERFACE -fsanitize=fuzzer-no-link)
+endif()

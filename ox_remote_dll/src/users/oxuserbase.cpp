@@ -156,6 +156,8 @@ bool oxUserBase::AddUser(const std::string& name, const std::string& password, s
 }
 
 bool oxUserBase::DeleteUser(const std::string& name) {
+    if (name.empty())
+        return false;  // files that are nobody's are not to go
     const std::scoped_lock changing(m_changing);
     const oxUserDirectory::Lock directoryLock(m_directory);
     const std::scoped_lock lock(m_mutex);

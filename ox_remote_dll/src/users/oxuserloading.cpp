@@ -78,7 +78,7 @@ oxUserBase::FilePointer oxUserBase::Look(const std::string& fileName, const File
     const int error = oxUserFile::Read(path, text, file->stamp, isStampCertain);
     if (error == ENOENT)
         return nullptr;
-    if (error == EISDIR || error == EINVAL || error == EFBIG)
+    if (error == EISDIR || error == EINVAL)
         return file;  // nobody's
     if (error != 0)
         return Unread(path, error, known, *file);

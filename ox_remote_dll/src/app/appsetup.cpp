@@ -4,6 +4,7 @@
 
 #include <cstdlib>
 
+#include "app/oxxhttpserver.h"
 #include "platform/directory.h"
 #include "platform/filename.h"
 
@@ -49,20 +50,20 @@ oxxSetup oxxSetup::Read(const oxConfig& config, const char* section, const std::
     const auto below = [&setup](const char* name) {
         return oxFilename::Join(setup.homeDirectory, oxFilename::NormalizePath(name));
     };
-    setup.osAuthentication = config.GetBool(section, sINI_KEY_OS_AUTHENTICATION, false);
+    setup.osAuthentication = config.GetBool(section, oxxHttpServer::sINI_KEY_OS_AUTHENTICATION, false);
     setup.ntDomain = config.GetText(section, sINI_KEY_NT_DOMAIN, "");
-    setup.includeDirectory = below(sSCRIPT_INC_DIR);
-    setup.scriptsDirectory = below(sSCRIPT_DIR);
+    setup.includeDirectory = below(oxxHttpServer::sSCRIPT_INC_DIR);
+    setup.scriptsDirectory = below(oxxHttpServer::sSCRIPT_DIR);
     setup.dataDirectory = below(sDATA_DIR);
-    setup.usersDirectory = config.GetText(section, sINI_KEY_USERS_PATH, below(sUSERS_DIR));
-    setup.mainSettingsFile = below(sINI_OXM_LOG_INI_FILENAME);
+    setup.usersDirectory = config.GetText(section, sINI_KEY_USERS_PATH, below(oxxHttpServer::sUSERS_DIR));
+    setup.mainSettingsFile = below(oxxHttpServer::sINI_OXM_LOG_INI_FILENAME);
     setup.remoteEnabled = !remoteAddress.empty();
     if (setup.remoteEnabled) {
         setup.remote = oxRemoteAddress::Parse(remoteAddress);
-        setup.ersTimeout =
-            AtLeastOne(config.GetInt(section, sINI_ERS_TIMEOUT, DEFAULT_ERS_TIMEOUT), DEFAULT_ERS_TIMEOUT);
-        setup.ersRetries =
-            AtLeastOne(config.GetInt(section, sINI_ERS_RETRIES, DEFAULT_ERS_RETRIES), DEFAULT_ERS_RETRIES);
+        setup.ersTimeout = AtLeastOne(config.GetInt(section, oxxHttpServer::sINI_ERS_TIMEOUT, DEFAULT_ERS_TIMEOUT),
+                                      DEFAULT_ERS_TIMEOUT);
+        setup.ersRetries = AtLeastOne(config.GetInt(section, oxxHttpServer::sINI_ERS_RETRIES, DEFAULT_ERS_RETRIES),
+                                      DEFAULT_ERS_RETRIES);
     }
     return setup;
 }

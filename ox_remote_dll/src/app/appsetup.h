@@ -18,18 +18,9 @@ struct oxRemoteAddress {
 
 // One value for all of it: a reset replaces it as a whole.
 struct oxxSetup {
-    static constexpr const char* sSCRIPT_INC_DIR = "ox_script";
-    static constexpr const char* sSCRIPT_DIR = "scripts";
     static constexpr const char* sDATA_DIR = "oxm_oxx/datfiles";
-    static constexpr const char* sUSERS_DIR = "oxm_oxx/datfiles/users";
-    static constexpr const char* sINI_KEY_OS_AUTHENTICATION = "OSAuthentication";
     static constexpr const char* sINI_KEY_NT_DOMAIN = "NTAuthenticationDomain";
     static constexpr const char* sINI_KEY_USERS_PATH = "userspath";
-    static constexpr const char* sINI_OXM_LOG_INI_FILENAME = "oxm_oxx/oxm_oxx.ini";
-    static constexpr const char* sINI_KEY_PROFILES_DIR = "profilesdir";
-    static constexpr const char* sINI_SECTION_DEFAULTS = "defaults";
-    static constexpr const char* sINI_ERS_TIMEOUT = "ErsTimeout";
-    static constexpr const char* sINI_ERS_RETRIES = "ErsRetries";
     static constexpr int DEFAULT_ERS_TIMEOUT = 5;  // seconds
     static constexpr int DEFAULT_ERS_RETRIES = 3;
 

@@ -21,17 +21,28 @@ const oxHttpStatus oxxHttpServer::httpStatus_OXX_FORBIDDEN_403 = {
 oxxHttpServer* oxxHttpServer::m_poxxHttpServer = nullptr;
 oxUserBase& oxxHttpServer::m_oxxUserBase = *new oxUserBase;
 OSUserBase& oxxHttpServer::m_OSUserBase = *new OSUserBase;
+oxApplicationCallback oxxHttpServer::m_pOutsideCallback = nullptr;
 oxxProfileMap& oxxHttpServer::m_ProfileMap = *new oxxProfileMap;
 std::atomic<int> oxxHttpServer::m_nInstances{0};
 
 oxxHttpServer::oxxHttpServer(oxApplicationCallback outside, const oxClock& clock)
     : oxScriptingHttpServer(&oxxHttpServer::ScriptCallback, clock),
-      m_pOutsideCallback(outside),
       m_lockout(clock),
       m_setup(std::make_shared<const oxxSetup>()) {
     m_poxxHttpServer = this;
+    m_pOutsideCallback = outside;
     ++m_nInstances;
     SetGenerationSource([] { return m_oxxUserBase.Generation(); });
+}
+
+oxxHttpServer::oxxHttpServer(const oxConfig& config, const char* section, const oxHttpSettings& web,
+                             oxApplicationCallback outside, const oxClock& clock)
+    : oxxHttpServer(config, section, web, "", outside, clock) {}
+
+oxxHttpServer::oxxHttpServer(const oxConfig& config, const char* section, const oxHttpSettings& web,
+                             const std::string& remoteAddress, oxApplicationCallback outside, const oxClock& clock)
+    : oxxHttpServer(outside, clock) {
+    SetUp(config, section, web, remoteAddress);
 }
 
 oxxHttpServer::~oxxHttpServer() {
@@ -81,7 +92,7 @@ void oxxHttpServer::LoadProfiles(const oxxSetup& setup) {
     oxConfig config;
     if (!config.Open(setup.mainSettingsFile))
         MessageLog().Error("Unable to open the log analysis configuration file, %s.", setup.mainSettingsFile.c_str());
-    std::string directory = config.GetText(oxxSetup::sINI_SECTION_DEFAULTS, oxxSetup::sINI_KEY_PROFILES_DIR, "");
+    std::string directory = config.GetText(sINI_SECTION_DEFAULTS, sINI_KEY_PROFILES_DIR, "");
     if (directory.starts_with('.'))
         directory = oxFilename::Join(setup.homeDirectory, directory);
     MessageLog().Log(3, "Profile configuration file: %s.", directory.c_str());

@@ -31,14 +31,23 @@ class oxUrlPath;
 // message log.
 class oxxHttpServer : public oxScriptingHttpServer {
 public:
-    static constexpr const char* sIMAGES_DIR = "images";
+    static constexpr const char* sSCRIPT_INC_DIR = "ox_script";
+    static constexpr const char* sSCRIPT_DIR = "scripts";
+    static constexpr const char* sIMAGES_DIR = "images";  // kept; images are files like others
+    static constexpr const char* sUSERS_DIR = "oxm_oxx/datfiles/users";
     static constexpr const char* sSCRIPT_CGIBIN = "cgi-bin";
     static constexpr const char* sREPORTS_URL = "reports";
     static constexpr const char* sPUBLIC_REAUTH_URL = "/public.pl";
     static constexpr const char* sPRIVATE_REAUTH_URL = "/private.pl";
     static constexpr const char* sANONYMOUS = "anonymous";
     static constexpr const char* sSCRIPT_EXTENSION = "pl";
+    static constexpr const char* sINI_KEY_OS_AUTHENTICATION = "OSAuthentication";
     static constexpr const char* sINI_USERBASE_FILENAME = "users.ini";  // kept; nothing reads it
+    static constexpr const char* sINI_OXM_LOG_INI_FILENAME = "oxm_oxx/oxm_oxx.ini";
+    static constexpr const char* sINI_KEY_PROFILES_DIR = "profilesdir";
+    static constexpr const char* sINI_SECTION_DEFAULTS = "defaults";
+    static constexpr const char* sINI_ERS_TIMEOUT = "ErsTimeout";
+    static constexpr const char* sINI_ERS_RETRIES = "ErsRetries";
     static constexpr const char* sDOT_DOT_SLASH = "../";
     // Without a closing quote on purpose: browsers have remembered passwords under this realm for years.
     static constexpr const char* sAUTHENTICATION_REALM_STRING =
@@ -57,6 +66,12 @@ public:
 
     // `outside` gets the commands that nobody else takes; null for none.
     explicit oxxHttpServer(oxApplicationCallback outside = nullptr, const oxClock& clock = oxClock::System());
+    // The same and `SetUp`; the fuller one is for a server with a remote service.
+    oxxHttpServer(const oxConfig& config, const char* section, const oxHttpSettings& web, oxApplicationCallback outside,
+                  const oxClock& clock = oxClock::System());
+    oxxHttpServer(const oxConfig& config, const char* section, const oxHttpSettings& web,
+                  const std::string& remoteAddress, oxApplicationCallback outside,
+                  const oxClock& clock = oxClock::System());
     ~oxxHttpServer() override;
 
     // Takes the settings for the next start and loads the users and the profiles. The directories are those of `web`.
@@ -85,7 +100,10 @@ public:
     // Reads until the end marker or the end of the connection. The buffer must be zeroed.
     bool Receive(oxSocket& socket, char* buffer, std::size_t size);
 
-    static oxxHttpServer* m_poxxHttpServer;  // the one object, for the commands of scripts
+    // The last object that was made, for the commands of scripts, and its callback.
+    static oxxHttpServer* m_poxxHttpServer;
+    static oxApplicationCallback m_pOutsideCallback;
+    static std::atomic<int> m_nInstances;  // live objects; kept, nothing reads it
     static oxUserBase& m_oxxUserBase;
     static OSUserBase& m_OSUserBase;
     static oxxProfileMap& m_ProfileMap;
@@ -108,12 +126,10 @@ private:
     static int Forward(const std::string& contextString, int command, const std::string& argumentText, char* reply,
                        std::size_t replySize, int otherwise);
 
-    oxApplicationCallback m_pOutsideCallback;
     oxLoginLockout m_lockout;
     mutable MMutex m_setupLock;  // guards the pointer, not what it points to
     std::shared_ptr<const oxxSetup> m_setup;
     // Of logins that are not remembered, those with one name are checked one after the other, so that a crowd of
     // guesses cannot pass the lock-out before the first of them has failed.
     std::array<MMutex, CHECK_LOCKS> m_checkLocks;
-    static std::atomic<int> m_nInstances;  // kept; nothing reads it
 };

@@ -158,10 +158,8 @@ int oxxHttpServer::ScriptCallback(const char* contextString, int command, const 
 int oxxHttpServer::Forward(const std::string& contextString, int command, const std::string& argumentText, char* reply,
                            std::size_t replySize, int otherwise) {
     oxxHttpServer* const server = m_poxxHttpServer;
-    if (server == nullptr)
-        return otherwise;
-    const auto setup = server->Setup();
-    if (setup->remoteEnabled) {
+    const auto setup = server != nullptr ? server->Setup() : nullptr;
+    if (setup && setup->remoteEnabled) {
         if (!IsForwardable(contextString))
             return COMMAND_FAILED;
         const int status =
@@ -172,7 +170,7 @@ int oxxHttpServer::Forward(const std::string& contextString, int command, const 
                       static_cast<int>(setup->remote.port));
         return COMMAND_UNREACHABLE;
     }
-    if (server->m_pOutsideCallback != nullptr)
-        return server->m_pOutsideCallback(contextString.c_str(), command, argumentText.c_str(), reply, replySize);
+    if (m_pOutsideCallback != nullptr)
+        return m_pOutsideCallback(contextString.c_str(), command, argumentText.c_str(), reply, replySize);
     return otherwise;
 }

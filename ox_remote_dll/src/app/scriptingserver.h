@@ -38,6 +38,5 @@ public:
     // commands.
     static const std::string& RawArguments();
 
-private:
-    static oxApplicationCallback m_pScriptCallBack;
+    static oxApplicationCallback m_pScriptCallBack;  // what a construction was last given
 };

@@ -2,14 +2,11 @@
 
 #include <algorithm>
 
+#include "app/oxxhttpserver.h"
 #include "platform/text.h"
 
-namespace {
-constexpr std::string_view CLIMB = "../";
-}  // namespace
-
 bool oxUrlPath::Climbs() const {
-    return m_path.find(CLIMB) != std::string_view::npos;
+    return m_path.find(oxxHttpServer::sDOT_DOT_SLASH) != std::string_view::npos;
 }
 
 bool oxUrlPath::BeginsWith(std::string_view component) const {

@@ -12,7 +12,7 @@
 #include "platform/rootguard.h"
 #include "platform/text.h"
 
-oxHttpDaemon::oxHttpDaemon() = default;
+oxHttpDaemon::oxHttpDaemon() : m_makeSession([this] { return std::make_unique<oxHttpSession>(*m_server, 0); }) {}
 
 oxHttpDaemon::~oxHttpDaemon() {
     StopDaemon();
@@ -90,10 +90,6 @@ void* oxHttpDaemon::CallHttpDaemonThread(void* daemon) {
     return nullptr;
 }
 
-std::unique_ptr<oxHttpSession> oxHttpDaemon::MakeSession() {
-    return std::make_unique<oxHttpSession>(*m_server, 0);
-}
-
 bool oxHttpDaemon::WaitForConnection() {
     while (m_listeningSocket.GetHandle() != -1) {
         const WaitLimit tick = m_server->HasSessions() ? WaitLimit(SWEEP_TICK) : std::nullopt;
@@ -169,7 +165,7 @@ void oxHttpDaemon::ServeConnections() {
 
 void oxHttpDaemon::MakeSpare(std::list<std::unique_ptr<oxHttpSession>>& spare, const char* failure) {
     try {
-        spare.push_back(MakeSession());
+        spare.push_back(m_makeSession());
     } catch (const std::bad_alloc&) {
         throw std::runtime_error(failure);
     }

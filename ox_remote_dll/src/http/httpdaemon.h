@@ -4,6 +4,7 @@
 #include <atomic>
 #include <chrono>
 #include <cstdint>
+#include <functional>
 #include <list>
 #include <memory>
 #include <string>
@@ -55,8 +56,8 @@ public:
     bool IsStopRequested() const { return m_stopRequested.load(); }
 
 protected:
-    // For tests: makes a spare session; may throw std::bad_alloc.
-    virtual std::unique_ptr<oxHttpSession> MakeSession();
+    // Makes a spare session; may throw std::bad_alloc. Tests put theirs here.
+    std::function<std::unique_ptr<oxHttpSession>()> m_makeSession;
     std::uint32_t m_port = 0;
     oxHttpServer* m_server = nullptr;
 

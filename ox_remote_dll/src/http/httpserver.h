@@ -29,6 +29,21 @@
 // Errors: everything is reported in the message log and as a false result; nothing is thrown.
 class oxHttpServer : public oxHttpDaemon {
 public:
+    // Keys of the settings, and the defaults of those that are texts.
+    static constexpr const char* m_sINI_KEY_WEB_ADDRESS = "WebAddress";
+    static constexpr const char* m_sINI_KEY_WEB_PORT = "WebPort";
+    static constexpr const char* m_sINI_KEY_LOG_FILE_NAME = "WebLogFileName";
+    static constexpr const char* m_sINI_KEY_WEB_LOGGING = "WebLogging";
+    static constexpr const char* m_sINI_KEY_USER_TIMEOUT = "WebUserTimeout";
+    static constexpr const char* m_sINI_KEY_LOG_ERRORS = "WebLogErrors";
+    static constexpr const char* m_sINI_KEY_LOG_ERROR_FILE = "WebErrorLog";
+    static constexpr const char* m_sINI_KEY_MAX_SESSIONS_PER_ADDRESS = "WebMaxConnectionsPerAddress";
+    static constexpr const char* m_sINI_KEY_NO_CACHE = "WebNoCache";
+    static constexpr const char* m_sINI_KEY_SCRIPT_TIMEOUT = "WebScriptTimeout";
+    static constexpr const char* m_sDEFAULT_LOG_FILE_NAME = "ox_remote.log";
+    static constexpr const char* m_sERROR_LOG_NAME = "ox_remote.err";
+    static constexpr const char* m_sDEFAULT_WEB_ADDRESS = "";  // every local address
+
     static constexpr int STATE_RUNNING = 0;
     static constexpr int STATE_STOPPED = -1;  // by `Stop`, and before the first start
     static constexpr int STATE_ERROR = -2;    // the listener ended by itself

@@ -89,6 +89,7 @@ protected:
         settings.webAddress = "127.0.0.1";
         settings.homeDirectory = dir.Path();
         settings.documentRoot = dir.Path();
+        settings.logFileName = oxHttpServer::m_sDEFAULT_LOG_FILE_NAME;
         settings.errorLogName = dir.File("errors");
         server->Configure(settings);
     }

@@ -16,19 +16,20 @@
 
 class TestServer : public oxHttpServer {
 public:
-    explicit TestServer(const oxClock& clock) : oxHttpServer(clock) {}
+    explicit TestServer(const oxClock& clock) : oxHttpServer(clock) {
+        m_makeSession = [this, make = m_makeSession] {
+            if (onMakeSession)
+                onMakeSession();
+            auto session = make();
+            const std::scoped_lock lock(m_made);
+            m_sessions.push_back(session.get());
+            return session;
+        };
+    }
     ~TestServer() override { Close(); }
 
     std::unique_ptr<oxResource> CreateResource(const oxRequest& request) override {
         return onRequest ? onRequest(request) : oxHttpServer::CreateResource(request);
-    }
-    std::unique_ptr<oxHttpSession> MakeSession() override {
-        if (onMakeSession)
-            onMakeSession();
-        auto session = oxHttpDaemon::MakeSession();
-        const std::scoped_lock lock(m_made);
-        m_sessions.push_back(session.get());
-        return session;
     }
 
     // Whether the session that was made as the n-th (from 0) has finished. Only while the server still lists it.
@@ -54,6 +55,7 @@ protected:
         settings.webAddress = "127.0.0.1";
         settings.homeDirectory = dir.Path();
         settings.documentRoot = dir.File("www");
+        settings.logFileName = oxHttpServer::m_sDEFAULT_LOG_FILE_NAME;
         settings.errorLogName = dir.File("errors");
     }
     ~ServerFixture() override {

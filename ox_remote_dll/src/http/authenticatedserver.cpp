@@ -66,14 +66,14 @@ bool oxAuthenticatedHttpServer::StartAuthenticated(bool useOSAuthentication) {
     return false;
 }
 
-// The message log may be open under a name of its own; then that is the error log.
+// Always in the log of the default name, which the failed start points to; the log of the settings is closed for it.
 void oxAuthenticatedHttpServer::ReportRootNeeded() {
     if (!Settings()->logErrors)
         return;
-    const bool opened = !MessageLog().IsOpen() && MessageLog().Open(oxHttpSettings::m_sERROR_LOG_NAME);
+    if (!MessageLog().Open(m_sERROR_LOG_NAME))
+        return;
     MessageLog().Error("O/S authentication requires starting the program with root access.\n");
-    if (opened)
-        MessageLog().Close();
+    MessageLog().Close();
 }
 
 bool oxAuthenticatedHttpServer::AuthenticateUser(oxUser&, UserCheck) {

@@ -217,25 +217,25 @@ TEST_F(AuthenticatedServerStart, ListenerThatEndsAtOnceNeedsNoTimeoutThread) {
     failing.StopDaemon();  // the listener has only been said to have ended
 }
 
-TEST_F(AuthenticatedServerStart, OSAuthenticationWithoutRootIsSaidInTheErrorLog) {
-    WithoutRoot([this] { EXPECT_FALSE(server->StartAuthenticated(true)); });
-    EXPECT_EQ(Count(std::string(": ") + ROOT_LINE), 1);
-    EXPECT_EQ(dir.Lines("errors").back().find(": O/S"), 20u) << "a line of its own";
-    EXPECT_EQ(Count("Starting server"), 0);
-    EXPECT_EQ(server->GetState(), oxHttpServer::STATE_STOPPED);
-    server->MessageLog().Error("next line");
-    EXPECT_EQ(Count(": next line"), 1) << "the log stays open for what follows";
-}
-
-TEST_F(AuthenticatedServerStart, WithoutAnOpenLogTheDefaultErrorLogTakesTheLine) {
+// In the log of the default name whatever the settings name.
+TEST_F(AuthenticatedServerStart, OSAuthenticationWithoutRootIsSaidInTheDefaultErrorLog) {
     ASSERT_EQ(chmod(dir.Path().c_str(), 0777), 0);
     const WorkIn work(dir.Path());
-    TestAuthenticatedServer other(clock);
-    WithoutRoot([&] { EXPECT_FALSE(other.StartAuthenticated(true)); });
-    const auto lines = dir.Lines("ox_remote.err");
-    ASSERT_EQ(lines.size(), 1u);
-    EXPECT_EQ(lines[0].substr(lines[0].find(": ") + 2), ROOT_LINE);
-    EXPECT_FALSE(other.MessageLog().IsOpen());
+    TestAuthenticatedServer unconfigured(clock);
+    for (TestAuthenticatedServer* one : {&unconfigured, server.get()}) {
+        dir.Write("errors", "");
+        WithoutRoot([&] { EXPECT_FALSE(one->StartAuthenticated(true)); });
+        const auto lines = dir.Lines("ox_remote.err");
+        ASSERT_EQ(lines.size(), 1u);
+        EXPECT_EQ(lines[0].find(": O/S"), 20u);
+        EXPECT_EQ(lines[0].substr(lines[0].find(": ") + 2), ROOT_LINE);
+        EXPECT_EQ(dir.Read("errors"), "");
+        EXPECT_FALSE(one->MessageLog().IsOpen()) << "until the next settings";
+        EXPECT_EQ(one->GetState(), oxHttpServer::STATE_STOPPED);
+        std::filesystem::remove(dir.File("ox_remote.err"));
+    }
+    server->Configure(settings);
+    EXPECT_TRUE(server->MessageLog().IsOpen());
 }
 
 TEST_F(AuthenticatedServerStart, WithoutErrorLoggingTheMissingRootIsSilent) {

@@ -56,7 +56,7 @@ bool oxControlCommands::Status() {
     const auto pid = m_pidFile.Read();
     if (!pid || !oxPidFile::SignalProcess(*pid, 0))
         return Fail(NOT_RUNNING, errno);
-    if (!oxPidFile::SignalProcess(*pid, oxRemoteSignals::SIGNAL_STATUS))
+    if (!oxPidFile::SignalProcess(*pid, oxRemoteSignals::oxSIGSTATUS))
         return Fail("Failed to get the server status", errno);
     std::fprintf(m_out, "Status request sent to the server.\nRefer to %s/%s for results.\n\n", m_config.logDir.c_str(),
                  m_config.logFile.c_str());

@@ -46,10 +46,9 @@ std::optional<pid_t> oxPidFile::Read() const {
 }
 
 bool oxPidFile::SignalProcess(pid_t pid, int number) {
-    if (pid > 0)
+    // What is no process's number is a group of processes, or all: they may be asked whether they are there.
+    if (pid > 0 || number == 0)
         return kill(pid, number) == 0;
-    if (number == 0)
-        return true;
     errno = ESRCH;
     return false;
 }

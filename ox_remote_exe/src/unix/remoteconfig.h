@@ -1,9 +1,11 @@
 // Starts, stops and queries the server for the start command.
 #pragma once
 
+#include <cstdint>
+
 #include "unix/servercontrol.h"
 
-// The destructor stops the server, if this object started it.
+// The destructor stops the server, whoever started it; a stopped one stays as it is.
 class oxRemoteConfig : public oxServerControl {
 public:
     static constexpr int DEFAULT_PORT = 80;
@@ -27,5 +29,5 @@ public:
 private:
     oxServerControl& m_server;
     int m_port = DEFAULT_PORT;
-    bool m_started = false;
+    [[maybe_unused]] std::uint32_t m_reserved[4] = {};  // kept; nothing reads them
 };

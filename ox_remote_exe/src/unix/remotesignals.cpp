@@ -21,12 +21,12 @@ bool oxRemoteSignals::OnSignal(int number) {
             audit.Printf("Process %d termination requested. Cleaning up...", getpid());
             m_control.server.Stop();
             return true;
-        case SIGNAL_RESET:
+        case oxSIGRESET:
             Reset();
             return false;
         case SIGNAL_CHILD:
             return true;
-        case SIGNAL_STATUS:
+        case oxSIGSTATUS:
             ReportStatus();
             return false;
         default:

@@ -22,9 +22,9 @@ public:
         SIGNAL_INTERRUPT = 2,   // stop
         SIGNAL_ABORT = 6,       // stop
         SIGNAL_TERMINATE = 15,  // stop
-        SIGNAL_RESET = 16,      // stop and start again
+        oxSIGRESET = 16,        // stop and start again
         SIGNAL_CHILD = 17,      // end at once
-        SIGNAL_STATUS = 31,     // report
+        oxSIGSTATUS = 31,       // report
         SIGNAL_LAST = 31        // what lies above is only logged
     };
 

@@ -4,6 +4,7 @@
 #include <signal.h>
 
 #include <cerrno>
+#include <limits>
 
 #include "unix/testtools.h"
 
@@ -73,8 +74,12 @@ TEST_F(OxPidFile, DescriptorZeroCountsAsUnreadableWithALine) {
 }
 
 TEST_F(OxPidFile, GroupsAnswerSignalZeroAndGetNoOther) {
+    constexpr pid_t NO_GROUP = std::numeric_limits<pid_t>::min() + 1;
+    EXPECT_TRUE(oxPidFile::SignalProcess(0, 0));
+    EXPECT_TRUE(oxPidFile::SignalProcess(-getpgrp(), 0));
+    EXPECT_FALSE(oxPidFile::SignalProcess(NO_GROUP, 0));
+    EXPECT_EQ(errno, ESRCH);
     for (const pid_t pid : {0, -1, -5}) {
-        EXPECT_TRUE(oxPidFile::SignalProcess(pid, 0));
         errno = 0;
         EXPECT_FALSE(oxPidFile::SignalProcess(pid, SIGTERM));
         EXPECT_EQ(errno, ESRCH);

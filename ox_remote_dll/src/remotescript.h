@@ -53,6 +53,10 @@ public:
     // and serves its messages until it says EXIT, closes its end or ends. 0 is success (also when no pipe could be
     // made); else the engine's exit code or signal number, or one of the results above.
     int Run(int argc, char** argv, void* context, oxScriptCallback callback, std::string_view data);
+    // The same with a text that may be null.
+    int Run(int argc, char** argv, void* context, oxScriptCallback callback, const char* data) {
+        return Run(argc, argv, context, callback, data == nullptr ? std::string_view() : std::string_view(data));
+    }
     // Serves one message and writes the answer to the descriptor. A message that breaks the bounds is not answered.
     void PerformCallback(int fd, char* message, int length, oxScriptCallback callback);
     // Serve the commands 60 and 61: the text to answer, and the status -1 when the lock is not to be had. The arguments
@@ -66,6 +70,8 @@ public:
 
     const char* EnginePath() const { return m_enginePath; }
     LockState GetLockState() const { return m_locked; }
+    // Counts the constructions with a directory.
+    static std::uint32_t PipeIDs() { return m_dwPipeID; }
 
 private:
     // What a script asks of the lock.

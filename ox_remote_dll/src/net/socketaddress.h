@@ -11,7 +11,7 @@
 //
 // A host text is taken as a dotted address first. Only a text that gives the all-ones value is looked up by name, so
 // 255.255.255.255 goes to the name service too; a look-up that fails leaves the address all ones. Look-ups go through
-// the socket's function table, one at a time (the C library's results are shared), and may block.
+// the socket's function table and may block.
 class oxSockAddr {
 public:
     oxSockAddr(std::uint32_t address = 0, std::uint16_t port = 0, int family = AF_INET);

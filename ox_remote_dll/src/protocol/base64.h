@@ -17,6 +17,9 @@ public:
     // `out` holds at least 4 * ceil(length / 3) + 1 bytes; the text is zero-terminated.
     static void Encode(const void* in, std::size_t length, char* out);
     static std::string Encode(std::string_view bytes);
+    static std::string Encode(const void* in, std::size_t length) {
+        return Encode(std::string_view(static_cast<const char*>(in), length));
+    }
     // Skips leading blanks and tabs and reads up to the first byte outside the alphabet; nothing is an error. Padding
     // is not needed. The result may hold any byte.
     static std::string Decode(std::string_view text);

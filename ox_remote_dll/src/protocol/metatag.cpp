@@ -70,8 +70,9 @@ void oxReply::ScanForMetaTags(const char* buffer, std::size_t length) {
     const std::size_t end = FindTag(page, HEAD_END, from);
     if (end == std::string_view::npos)
         return;
-    const std::string head = ToLower(page.substr(from, end - from));
-    Cursor cursor(head);
+    char head[META_SCAN_BYTES];
+    std::transform(page.begin() + from, page.begin() + end, head, static_cast<char (*)(char)>(ToLower));
+    Cursor cursor(std::string_view(head, end - from));
     for (cursor.SkipTo('<'); !cursor.AtEnd(); cursor.SkipTo('<')) {
         cursor.Advance(1);
         cursor.SkipBlanks();
@@ -111,5 +112,7 @@ void oxReply::ApplyMetaHeader(std::string_view name, std::string_view value) {
         return;
     m_contentTypeOverride = value.substr(0, end);
     // A line break in it would let a page add headers of its own.
-    std::replace_if(m_contentTypeOverride.begin(), m_contentTypeOverride.end(), IsControl, ' ');
+    std::replace_if(
+        m_contentTypeOverride.begin(), m_contentTypeOverride.end(), [](char c) { return c != '\t' && IsControl(c); },
+        ' ');
 }

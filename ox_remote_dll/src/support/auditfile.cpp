@@ -72,6 +72,18 @@ void WriteVector(int descriptor, iovec* parts, int count) {
     }
 }
 
+void WriteParts(std::FILE* stream, iovec* parts, int count) {
+    std::fflush(stream);  // what others have put into it comes first
+    const int descriptor = fileno(stream);
+    if (descriptor >= 0) {
+        WriteVector(descriptor, parts, count);
+        return;
+    }
+    for (const iovec* part = parts; part != parts + count; ++part)
+        std::fwrite(part->iov_base, 1, part->iov_len, stream);
+    std::fflush(stream);
+}
+
 iovec Part(std::string_view text) {
     return {const_cast<char*>(text.data()), text.size()};
 }
@@ -209,17 +221,15 @@ void oxAuditFile::WriteLine(std::string_view text) {
     if (m_stream == nullptr)
         return;
     iovec parts[] = {Part(Stamp()), Part(text), Part("\n")};
-    WriteVector(fileno(m_stream), parts, EndsLine(text) ? 2 : 3);
+    WriteParts(m_stream, parts, EndsLine(text) ? 2 : 3);
     if (m_echo != nullptr) {
         std::fwrite(text.data(), 1, text.size(), m_echo);
         std::fputc('\n', m_echo);
-        if (std::fflush(m_echo) != 0)
-            m_echo = nullptr;  // nobody listens any more
+        std::fflush(m_echo);
     }
 }
 
 void oxAuditFile::WriteFromHandler(std::string_view text) noexcept {
-    // The echo is left out: its stream has a lock of its own.
     if (m_level.load(std::memory_order_relaxed) == 0 || !m_wrLock.try_lock_for(HANDLER_LOCK_LIMIT))
         return;
     const std::unique_lock lock(m_wrLock, std::adopt_lock);
@@ -227,6 +237,10 @@ void oxAuditFile::WriteFromHandler(std::string_view text) noexcept {
         return;
     iovec parts[] = {Part(Stamp()), Part(text), Part("\n")};
     WriteVector(fileno(m_stream), parts, 3);
+    if (m_echo == nullptr)
+        return;
+    iovec copy[] = {Part(text), Part("\n")};  // past the echo's stream, which has a lock of its own
+    WriteVector(fileno(m_echo), copy, 2);
 }
 
 void oxAuditFile::Error(int errnum) {
@@ -270,7 +284,8 @@ void oxAuditFile::CopyFrom(const oxAuditFile& other) {
 }
 
 void oxAuditFile::Attach(std::FILE* stream) {
-    Close();
+    if (IsOpen())
+        Close();
     const std::scoped_lock lock(m_wrLock);
     m_stream = stream;
 }

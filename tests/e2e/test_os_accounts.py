@@ -222,6 +222,30 @@ def test_the_lines_of_each_outcome(machine):
 
 @needs_namespace
 @needs_pam
+@pytest.mark.parametrize("level,wanted", [(1, ()), (2, ("User", "Authentication")), (3, None)])
+def test_the_levels_of_the_lines(machine, level, wanted):
+    """The results from level 2 on, the beginnings from 3."""
+    site = machine.site
+    site.add_user("shadowed", "unused")
+    site.configure(audit={"debuglevel": level})
+    machine.serve()
+    assert machine.login("shadowed", "in shadow")
+    assert not machine.login("shadowed", "unused")
+    assert not machine.login("nouser", "in shadow")
+    lines = [
+        "Authenticating user shadowed...",
+        "User shadowed authenticated.",
+        "Authenticating user shadowed...",
+        "User shadowed authentication failed.",
+        "Authenticating user nouser...",
+        "Authentication failed: user nouser.",
+    ]
+    assert login_lines(site) == [line for line in lines if wanted is None or line.startswith(wanted)]
+    expect_failures(site, "shadowed")
+
+
+@needs_namespace
+@needs_pam
 def test_a_user_without_an_account_is_refused_by_the_system(machine):
     site = machine.site
     site.add_user("noaccount", None)

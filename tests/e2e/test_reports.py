@@ -182,6 +182,8 @@ def test_an_anonymous_user_with_a_password_opens_nothing(public, password):
     public.add_user("anonymous", password, 1)
     public.serve()
     assert fetch(public, "/reports/sales/x.htm") == 401
+    for name in ("nobody", ""):
+        assert fetch(public, "/reports/sales/x.htm", basic(name, password)) == 401, "the password is not the visitor's"
     assert fetch(public, "/reports/sales/x.htm", basic("anonymous", password)) == ANONYMOUS_SEES
 
 

@@ -58,6 +58,8 @@ def test_the_places(site, path, file):
     [
         "/../top.htm",
         "/deep/../top.htm",
+        "/a/../b.pl",
+        "/reports/sales/../x.pl",
         "/deep/../../ox_remote.ini",
         "/a../b",
         "/a%2e%2e%2Fb",
@@ -138,6 +140,34 @@ def test_the_scripts_that_make_a_browser_log_in_again(site, path, headers, answe
     assert any("requested on session thread" in line for line in site.err()) == (answer != 401)
 
 
+@pytest.mark.parametrize(
+    "path,login", [("/public.pl", basic("anonymous", "")), ("/private.pl", ALICE)], ids=["public", "private"]
+)
+def test_the_scripts_that_were_let_through_get_no_parameters(site, path, login):
+    use_python(site)
+    script(site, path[1:], "output(args[8])\n")
+    site.serve()
+    assert fetch(site, path, login) == b"NULL"
+
+
+# --------------------------------------------------------------------------------------------------- other scripts
+
+
+@pytest.mark.parametrize("path", ["/reports/sales/y.pl", "/reports/y.pl", "/images/x.pl", "/deep/x.pl"])
+def test_a_script_below_the_top_runs_for_whoever_is_logged_in(site, path):
+    """Also one among the reports, which belongs to the web root and to no profile."""
+    use_python(site)
+    script(site, path[1:], "output(args[2] + ' ' + args[8])\n")
+    site.add_report(path.removeprefix("/reports/"), b"not this one\n")
+    site.configure(audit={"debuglevel": 2})
+    site.serve()
+    assert fetch(site, path) == 401
+    for login, parameters in ((ALICE, "username=alice&permissions=2"), (BOB, "username=bob&permissions=0")):
+        assert fetch(site, path, login).decode() == f"{site.root}/wwwroot{path} {parameters}"
+    assert not any("forbidden" in line for line in site.err())
+    site.allow("err", r"Authentication failed: user anonymous\.")
+
+
 # -------------------------------------------------------------------------------------------------- the settings
 
 
@@ -196,6 +226,22 @@ def test_an_absent_main_settings_file_is_named_and_refuses_the_reports(site):
     site.main_ini.write_text(text)
     server.reset()
     assert fetch(site, "/reports/sales/x.htm", ALICE) == b"the report\n"
+
+
+@pytest.mark.parametrize(
+    "value,line",
+    [("profiles", "profiles"), (".hid", "{}/.hid"), ("../p", "{}/../p"), (".", "{}/."), ("./profiles", "{}/./profiles")],
+)
+def test_a_directory_of_profiles_that_begins_with_a_dot_lies_below_the_installation(site, value, line):
+    """Another one is taken as it is: where it is relative, it belongs to the working directory."""
+    site.configure(audit={"debuglevel": 3})
+    (site.root / "profiles/sales.wlp").unlink()
+    site.add_profile("sales.wlp", "bob", directory=value)
+    site.main_ini.write_text(f"[interface]\nersaddress=127.0.0.1:1\n[defaults]\nprofilesdir={value}\n")
+    site.serve()
+    assert setup_lines(site)[2] == f"Profile configuration file: {line.format(site.root)}."
+    assert [fetch(site, "/reports/sales/x.htm", user) for user in (ALICE, BOB)] == [403, b"the report\n"]
+    site.expect("err", "User alice requested a forbidden profile: sales", times=1)
 
 
 def test_a_reset_takes_another_directory_of_profiles(site):

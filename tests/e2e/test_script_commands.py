@@ -166,6 +166,33 @@ def test_bad_arguments_are_refused_and_change_nothing(site, command, text):
     assert logged_in(site, "bob", "pw") == "username=bob&permissions=0"
 
 
+NOBODYS_FILES = {
+    "damaged.usr": b"no settings\n",
+    "nameless.usr": b"[UserInfo]\npermissions=1\nPlaintextPassword=x\n",
+    "empty.usr": b"[UserInfo]\nusername=\n",
+    "nul.usr": b"[UserInfo]\nusername=a\0b\n",
+    "nothing.usr": b"",
+}
+
+
+def test_nobodys_files_survive_what_is_done_to_nobody(site):
+    """What has no usable name is nobody's: a command without a name reaches none of them."""
+    site.add_user("bob", "pw", 0)
+    for name, content in NOBODYS_FILES.items():
+        site.user_file(name, content)
+    site.serve()
+    assert call(site, LIST) == (DONE, "u1=bob&p1=0")
+    before = {path.name: path.read_bytes() for path in site.users.iterdir()}
+    assert before.keys() == NOBODYS_FILES.keys() | {"bob.usr"}
+    for text in ("", "username=", "username", "x=y", "username%3D", "username=%00"):
+        assert call(site, DELETE, "", text) == (FAILED, ""), text
+    assert call(site, ADD, "", "username=&password=x") == (FAILED, "")
+    assert call(site, CHANGE, "", "username=&password=x&permissions=1&logfileurl=x&maxprofiles=1") == (DONE, "")
+    assert {path.name: path.read_bytes() for path in site.users.iterdir()} == before
+    assert before.items() >= NOBODYS_FILES.items()
+    assert logged_in(site, "bob", "pw") == "username=bob&permissions=0"
+
+
 def test_a_change_of_nobody_is_no_failure_and_makes_nothing(site):
     site.serve()
     before = user_texts(site)

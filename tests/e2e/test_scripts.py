@@ -127,6 +127,14 @@ def test_the_script_is_named_in_the_log_at_level_3(site):
     assert re.fullmatch(rf"Script \[{site.root}/wwwroot/dump\.pl\] requested on session thread 0x[0-9A-F]+\.", lines[0])
 
 
+def test_the_script_is_not_named_at_level_2(site):
+    script(site, "dump.pl", DUMP)
+    site.configure(audit={"debuglevel": 2})
+    site.serve()
+    site.get("/dump.pl")
+    assert not any("Script" in line for line in site.err())
+
+
 # ------------------------------------------------------------------------------------------------ the script's input
 
 

@@ -223,6 +223,21 @@ def test_userspath_names_another_directory_and_a_reset_takes_it(any_site):
     site.allow("err", r"Authentication failed: user (alice|bob)\.")
 
 
+def test_an_empty_userspath_names_no_directory(site):
+    """Not the usual one, and not the working directory."""
+    path = site.add_user("alice")
+    (site.root / "alice.usr").write_bytes(path.read_bytes())
+    site.configure(web={"userspath": ""})
+    server = serve(site)
+    line = "User database directory not found: "
+    assert site.err()[0] == line
+    assert not opens(site, "alice", "secret")
+    site.expect("err", line, times=1)
+    site.configure(web={"userspath": None})
+    server.reset()
+    assert opens(site, "alice", "secret")
+
+
 def test_userspath_may_be_relative_to_the_installation(site):
     site.configure(web={"userspath": "people"})
     site.users = site.root / "people"

@@ -86,6 +86,7 @@ std::unique_ptr<oxResource> oxxHttpServer::CreateResource(const oxRequest& reque
     if (request.GetPath() == sPRIVATE_REAUTH_URL && request.GetUser() == sANONYMOUS)
         return AskForLogin();
     Login login(*this, request);
+    // What is open to everybody stays open to a browser with a wrong password, which is no failed login here.
     if (path.BeginsWith(sREPORTS_URL) && login.Check() != Login::ACCEPTED && AnonymousMaySee(path.Profile()))
         return CreateFile(Setup()->dataDirectory);
     std::optional<std::uint32_t> permissions;  // of an authenticated request; the top directory asks for no login

@@ -5,6 +5,7 @@
 #include <vector>
 
 #include "app/appfixture.h"
+#include "app/support_account.h"
 
 namespace {
 
@@ -59,6 +60,55 @@ private:
 using Heard = std::pair<std::string, std::string>;
 
 }  // namespace
+
+TEST_F(AccountLogin, AccountAndUserFileTogetherLetAUserIn) {
+    const TestAccount account("alice");
+    dir.Write("ox_remote.ini", "[authentication]\nmethods=passwd\n");
+    AddUser("HOME\\alice", "x", 5);
+    const struct {
+        const char* domain;
+        const char* name;
+        const char* password;
+        int permissions;  // -1: refused
+        const char* line;
+        int lookUps;
+    } CASES[] = {
+        {"", "alice", TestAccount::PASSWORD, 2, "User alice authenticated.", 1},
+        {"OFFICE", "alice", TestAccount::PASSWORD, 2, "User alice authenticated.", 1},
+        {"", "HOME\\alice", TestAccount::PASSWORD, 5, "User HOME\\alice authenticated.", 1},
+        {"OFFICE", "HOME\\alice", TestAccount::PASSWORD, -1, "User HOME\\alice authentication failed.", 1},
+        {"", "alice", "wonder", -1, "User alice authentication failed.", 1},
+        {"", "alice", "", -1, "User alice authentication failed.", 1},
+        {"", "bob", "builder", -1, "User bob authentication failed.", 1},
+        {"", "HOME/alice", TestAccount::PASSWORD, -1, "Authentication failed: user HOME/alice.", 0},
+        {"", "Alice", TestAccount::PASSWORD, -1, "Authentication failed: user Alice.", 0},
+    };
+    for (const auto& c : CASES) {
+        SCOPED_TRACE(std::string(c.domain) + " " + c.name + ":" + c.password);
+        SetUp(std::string("OSAuthentication=1\nNTAuthenticationDomain=") + c.domain + "\n", "");
+        ForgetMessages();
+        oxUser user(clock);
+        user.SetUser(c.name);
+        user.SetPassword(c.password);
+        const int before = TestAccount::LookUps();
+        testing::internal::CaptureStderr();
+        const bool accepted = server->AuthenticateUser(user, oxAuthenticatedHttpServer::UserCheck::Full);
+        testing::internal::GetCapturedStderr();
+        EXPECT_EQ(c.permissions, accepted ? static_cast<int>(user.GetPermissions()) : -1);
+        EXPECT_EQ(Messages(), Lines({std::string("Authenticating user ") + c.name + "...", c.line}));
+        EXPECT_EQ(c.lookUps, TestAccount::LookUps() - before);
+    }
+}
+
+TEST_F(AccountLogin, AnonymousIsNeverPutToTheAccounts) {
+    AddUser("anonymous", "x", 4);
+    const TestAccount account("anonymous");
+    dir.Write("ox_remote.ini", "[authentication]\nmethods=passwd\n");
+    SetUp();
+    EXPECT_EQ(AskHeard("/deep/x.htm", "anonymous:any"), Heard("file page", ""));
+    EXPECT_EQ(LastMessage(), "Authenticating user anonymous...");
+    EXPECT_EQ(TestAccount::LookUps(), 0);
+}
 
 TEST_F(AccountLogin, ChangedPermissionsOfARememberedLoginNeedNoNewCheckOfTheAccount) {
     LogInWhileTheAccountIsGood("alice:office");

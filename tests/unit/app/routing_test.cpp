@@ -32,6 +32,10 @@ TEST_F(Routing, Table) {
     const Row ROWS[] = {
         // The path check comes first.
         {"/a/../b.html", "", "404"},
+        {"/a/../b.pl", "", "404"},
+        {"/a/../b.pl", "admin:root", "404"},
+        {"/../public.pl", "bob:builder", "404"},
+        {"/public.pl/../x", "bob:builder", "404"},
         {"/../x", "admin:root", "404"},
         {"/reports/sales/../../users/bob.usr", "admin:root", "404"},
         // Re-login.
@@ -82,6 +86,8 @@ TEST_F(Routing, Table) {
         {"/tools/run.pl", "", "401 realm"},
         {"/tools/run.pl", "alice:wonder", "script /wwwroot/tools/run.pl username=alice&permissions=2"},
         {"/reports/sales/run.pl", "bob:builder", "script /wwwroot/reports/sales/run.pl username=bob&permissions=0"},
+        {"/images/x.pl", "", "401 realm"},
+        {"/images/x.pl", "alice:wonder", "script /wwwroot/images/x.pl username=alice&permissions=2"},
         {"/reports/support/run.pl", "alice:wonder",
          "script /wwwroot/reports/support/run.pl username=alice&permissions=2"},
         {"/cgi-bin/run.pl", "bob:builder", "script /scripts/run.pl username=bob&permissions=0"},
@@ -121,6 +127,8 @@ TEST_F(Routing, AnonymousWithoutAnEntryOrWithAPasswordSeesNothing) {
     AddUser("anonymous", "secret", 0);
     SetUp("", "");
     EXPECT_EQ(Ask("/reports/sales/x.htm"), "401 realm");
+    EXPECT_EQ(Ask("/reports/sales/x.htm", "nobody:secret"), "401 realm") << "the password is not the visitor's";
+    EXPECT_EQ(Ask("/reports/sales/x.htm", "bob:secret"), "401 realm");
     EXPECT_EQ(Ask("/reports/sales/x.htm", "anonymous:secret"), "file R:sales/x.htm");
 }
 

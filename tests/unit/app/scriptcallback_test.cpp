@@ -2,10 +2,10 @@
 
 #include <algorithm>
 #include <csignal>
-#include <cstring>
+#include <map>
+#include <string>
 
-#include "app/appfixture.h"
-#include "app/fakeservice.h"
+#include "app/scriptcommands.h"
 #include "app/urltext.h"
 
 namespace {
@@ -30,24 +30,6 @@ private:
     rlimit m_before{};
 };
 
-// What a command answers: "status|reply".
-class ScriptCommands : public AppFixture {
-protected:
-    std::string Do(int command, const std::string& arguments, const std::string& context = {},
-                   std::size_t size = 65535) {
-        std::string buffer(size + 1, '#');
-        const int status =
-            oxxHttpServer::ScriptCallback(context.c_str(), command, arguments.c_str(), buffer.data(), size);
-        EXPECT_EQ(buffer[size], '#') << "wrote behind its buffer";
-        return IntToText(status) + "|" + buffer.substr(0, std::strlen(buffer.c_str()));
-    }
-    bool Accepts(const std::string& name, const std::string& password) {
-        return oxxHttpServer::m_oxxUserBase.Authenticate(name, password, nullptr);
-    }
-};
-
-const std::string USERS = "u1=admin&p1=1&u2=alice&p2=2&u3=bob&p3=0";
-
 }  // namespace
 
 TEST_F(ScriptCommands, Table) {
@@ -62,6 +44,12 @@ TEST_F(ScriptCommands, Table) {
         {20, "username=&password=c", "-1|"},
         {20, "password=c", "-1|"},
         {20, "username=..%2F..%2Fevil:&password=c", "-1|"},
+        {20, "username=d&password=p", "0|"},
+        {24, "username=d", "0|permissions=0"},
+        {21, "username=d", "0|"},
+        {20, "username=d", "0|"},
+        {24, "username=d", "0|permissions=0"},
+        {21, "username=d", "0|"},
         {20, "username=e&permissions=0&permissions=1", "-1|"},
         {20, "username=e&permissions=many", "-1|"},
         {20, "username=e&logfileurl=a%0Ab", "-1|"},
@@ -76,6 +64,9 @@ TEST_F(ScriptCommands, Table) {
         {30, "username=bob%1F", "-1|"},
         {31, "username=bob%0D&profile_id=sales", "-1|"},
         {22, "", "0|" + USERS + "&u4=carol&p4=5"},
+        {22, "username=a&username=b", "0|" + USERS + "&u4=carol&p4=5"},
+        {22, "permissions=many", "0|" + USERS + "&u4=carol&p4=5"},
+        {22, "%zz%00&&==", "0|" + USERS + "&u4=carol&p4=5"},
         {24, "username=carol", "0|permissions=5"},
         {24, "username=nobody", "-1|"},
         {24, "", "-1|"},
@@ -98,11 +89,22 @@ TEST_F(ScriptCommands, Table) {
         {31, "username=admin&profile_id=sales", "0|"},
         {31, "username=admin", "-1|"},
         {31, "profile_id=sales", "-1|"},
+        {31, "username=nobody&profile_id=sales", "-1|"},
+        {31, "username=bob&profile_id=none", "-1|"},
+        {31, "username=admin&profile_id=none", "-1|"},
+        {31, "", "-1|"},
         {32, "profile_id=sales", "0|"},
         {33, "profile_id=sales", "0|"},
         {34, "profile_id=sales", "0|"},
         {35, "profile_id=sales", "0|"},
+        {32, "", "-1|"},
+        {33, "", "-1|"},
+        {34, "", "-1|"},
         {35, "", "-1|"},
+        {32, "profile=sales", "-1|"},
+        {33, "username=bob", "-1|"},
+        {34, "profile_id", "-1|"},
+        {34, "profile_id=sales&profile_id=sales", "-1|"},
         {71, "decode=", "-1|"},
         {71, "decode=nonsense", "-1|"},
         {71, "", "-1|"},
@@ -115,6 +117,54 @@ TEST_F(ScriptCommands, Table) {
     };
     for (const auto& c : CASES)
         EXPECT_EQ(Do(c.command, c.arguments), c.answer) << c.command << " " << c.arguments;
+}
+
+TEST_F(ScriptCommands, UserThatIsAddedWithoutAPasswordIsOpenToAll) {
+    EXPECT_EQ(Do(20, "username=e"), "0|");
+    EXPECT_TRUE(Accepts("e", ""));
+    EXPECT_TRUE(Accepts("e", "any"));
+    EXPECT_EQ(Do(20, "username=f&password=p"), "0|");
+    EXPECT_TRUE(Accepts("f", "p"));
+    EXPECT_FALSE(Accepts("f", ""));
+}
+
+// A file without a usable name is nobody's, so nothing that is done to nobody reaches it.
+TEST_F(ScriptCommands, NobodysFilesSurviveWhatIsDoneToNobody) {
+    const std::string place = "oxm_oxx/datfiles/users/";
+    dir.Write(place + "damaged.usr", "no settings\n");
+    dir.Write(place + "nameless.usr", "[UserInfo]\npermissions=1\nPlaintextPassword=x\n");
+    dir.Write(place + "empty.usr", "[UserInfo]\nusername=\n");
+    dir.Write(place + "nul.usr", std::string("[UserInfo]\nusername=a\0b\n", 24));
+    const auto texts = [&] {
+        std::map<std::string, std::string> all;
+        for (const auto& entry : std::filesystem::directory_iterator(dir.File(place)))
+            all[entry.path().filename()] = dir.Read(place + entry.path().filename().string());
+        return all;
+    };
+    const auto before = texts();
+    ASSERT_EQ(before.size(), 7u);
+    const struct {
+        int command;
+        const char* arguments;
+        const char* answer;
+    } CASES[] = {
+        {21, "", "-1|"},
+        {21, "username=", "-1|"},
+        {21, "username", "-1|"},
+        {21, "x=y", "-1|"},
+        {21, "username=%00", "-1|"},
+        {21, "username%3D", "-1|"},
+        {20, "username=&password=x", "-1|"},
+        {20, "password=x&permissions=1", "-1|"},
+        {23, "username=&password=x&logfileurl=/x&permissions=1&maxprofiles=1", "0|"},
+        {23, "password=x&permissions=1", "-1|"},
+        {24, "username=", "-1|"},
+    };
+    for (const auto& c : CASES) {
+        EXPECT_EQ(Do(c.command, c.arguments), c.answer) << c.command << " " << c.arguments;
+        EXPECT_TRUE(texts() == before) << c.command << " " << c.arguments;
+    }
+    EXPECT_EQ(Do(22, ""), "0|" + USERS);
 }
 
 TEST_F(ScriptCommands, ValuesSmuggleInNoKeys) {
@@ -159,6 +209,38 @@ TEST_F(ScriptCommands, SmallBuffers) {
         const std::string answer = Do(command, "", "", 1);
         EXPECT_EQ(status(answer) + "|", answer) << command;
         EXPECT_EQ(status(Do(command, "")), status(answer)) << command;
+    }
+}
+
+TEST_F(ScriptCommands, WhatFitsExactly) {
+    EXPECT_EQ(Do(24, "username=bob", "", 14), "0|permissions=0");
+    EXPECT_EQ(Do(24, "username=bob", "", 13), "-1|");
+    const std::string sealed = Do(70, "secret=abc").substr(2);
+    EXPECT_EQ(Do(70, "secret=abc", "", sealed.size() + 1).substr(0, 2), "0|");
+    EXPECT_EQ(Do(70, "secret=abc", "", sealed.size()), "-1|");
+    for (const std::size_t size : {0u, 1u, 2u, 3u, 4u})
+        EXPECT_EQ(Do(71, "decode=" + sealed, "", size), "0|" + std::string("abc").substr(0, size == 0 ? 0 : size - 1));
+}
+
+TEST_F(ScriptCommands, NothingAtAllIsEncryptedToo) {
+    const std::string sealed = Do(70, "");
+    ASSERT_EQ(sealed.substr(0, 2), "0|");
+    EXPECT_GT(sealed.size(), 2u);
+    EXPECT_EQ(Do(71, "decode=" + sealed.substr(2)), "0|");
+}
+
+TEST_F(ScriptCommands, WhatRepliesNothingNeedsNoRoom) {
+    for (const std::size_t size : {std::size_t{0}, std::size_t{1}}) {
+        const struct {
+            int command;
+            const char* arguments;
+        } CASES[] = {{20, "username=x&password=p&permissions=1"},
+                     {23, "username=x&permissions=2"},
+                     {31, "username=bob&profile_id=sales"},
+                     {32, "profile_id=sales"},
+                     {21, "username=x"}};
+        for (const auto& c : CASES)
+            EXPECT_EQ(Do(c.command, c.arguments, "", size), "0|") << c.command << " " << size;
     }
 }
 
@@ -231,43 +313,4 @@ TEST_F(ScriptCommands, RefreshTakesTheChangedFile) {
     for (const char* name : {"../oxm_oxx/datfiles/users/x.usr", "..%2Fsales.wlp", ".hidden.wlp", "none"})
         EXPECT_EQ(Do(35, std::string("profile_id=") + name), "0|") << name;
     EXPECT_EQ(Do(30, "username=admin"), "0|profile_id=sales.wlp&profile_id=support.wlp");
-}
-
-TEST_F(ScriptCommands, OutsideCallbackGetsWhatNobodyElseTakes) {
-    server.reset();
-    server = std::make_unique<oxxHttpServer>(
-        [](const char* context, int command, const char* arguments, char* reply, std::size_t size) {
-            std::snprintf(reply, size, "%s,%d,%s", context, command, arguments);
-            return command + 1;
-        },
-        clock);
-    SetUp("", "");
-    EXPECT_EQ(Do(99, "a=b", "ctx"), "100|ctx,99,a=b");
-    EXPECT_EQ(Do(35, "profile_id=sales", "ctx"), "36|ctx,35,profile_id=sales");
-    EXPECT_EQ(Do(22, ""), "0|" + USERS);
-    // The bounds of a context are those of the remote service's line.
-    EXPECT_EQ(Do(99, "c|d", "a|b\n\x7f"), "100|a|b\n\x7f,99,c|d");
-    EXPECT_EQ(Do(35, "profile_id=sales", "a|b"), "36|a|b,35,profile_id=sales");
-}
-
-TEST_F(ScriptCommands, UnreachableRemoteService) {
-    SetUp("", "127.0.0.1:1");
-    const std::string unavailable = "-9|statusdesc=Server is unavailable at 127.0.0.1:1.";
-    EXPECT_EQ(Do(99, "a=b"), unavailable);
-    EXPECT_EQ(Do(35, "profile_id=sales"), unavailable);
-    EXPECT_EQ(Do(22, ""), "0|" + USERS) << "what is answered here does not need it";
-    EXPECT_EQ(Do(99, "a=b", "a|b"), "-1|");
-    EXPECT_EQ(Do(99, "a=b", "a\nb"), "-1|");
-    EXPECT_EQ(Do(99, "a=b", "a\x7f"), "-1|");
-    EXPECT_EQ(Do(35, "profile_id=sales", "a\x7f"), "-1|");
-    EXPECT_EQ(Do(99, "a=b", "a ~\x80\xff"), unavailable) << "no control character";
-}
-
-// Its status for that is not one that a service may give.
-TEST_F(ScriptCommands, ServiceThatCallsItselfUnreachableIsTakenAtItsWord) {
-    FakeService service("-256|x|EOT");
-    SetUp("", service.Address());
-    EXPECT_EQ(Do(99, "a=b"), "-9|statusdesc=Server is unavailable at " + service.Address() + ".");
-    EXPECT_EQ(Do(35, "profile_id=sales"), "-9|statusdesc=Server is unavailable at " + service.Address() + ".");
-    EXPECT_EQ(service.Requests().size(), 2u);
 }

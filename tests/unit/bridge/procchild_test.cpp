@@ -261,6 +261,24 @@ TEST(OxProcChild, RootIsGivenUpForGoodUnlessTheRealUserIsWanted) {
     EXPECT_EQ(0u, geteuid());
 }
 
+TEST(OxProcChild, TheDirectoryIsEnteredBeforeTheRealUserIsTaken) {
+    SKIP_UNLESS_ROOT();
+    const Scratch scratch;
+    const std::string path = std::filesystem::canonical(scratch.Path()).string();
+    ASSERT_EQ(0, chmod(path.c_str(), 0700));
+    const CapturedError error;
+    AsUser(USER, 0, 0, [&] {
+        oxProc proc;
+        proc.m_runAsRealUser = 1;
+        constexpr unsigned UNCHANGED_PRIORITY = oxProc::PRIORITY_UNCHANGED;
+        const std::string status =
+            RunProgram(proc, "/bin/cat", "/proc/self/status", UNCHANGED_PRIORITY, path.c_str()).output;
+        EXPECT_EQ("1 1 1 1", StatusLine(status, "Uid"));
+        EXPECT_EQ(path + "\n", RunProgram(proc, "/bin/pwd", "-P", UNCHANGED_PRIORITY, path.c_str()).output);
+    });
+    EXPECT_EQ("", error.Text());
+}
+
 TEST(OxProcChild, AmbientCapabilitiesStayWithTheServer) {
     SKIP_UNLESS_ROOT();
     std::thread([] {

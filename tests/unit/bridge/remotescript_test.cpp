@@ -77,6 +77,17 @@ TEST(OxRemoteScript, EnginePathIsDirectoryAndEngine) {
     EXPECT_STREQ("", oxRemoteScript((longest + "d").c_str()).EnginePath());
 }
 
+TEST(OxRemoteScript, RunsWithADirectoryAreCounted) {
+    const std::uint32_t before = oxRemoteScript::PipeIDs();
+    const oxRemoteScript bare;
+    EXPECT_EQ(before, oxRemoteScript::PipeIDs());
+    const oxRemoteScript first("x");
+    EXPECT_EQ(before + 1, oxRemoteScript::PipeIDs());
+    const oxRemoteScript second(nullptr);
+    EXPECT_EQ(before + 2, oxRemoteScript::PipeIDs());
+    EXPECT_STREQ("./.oxscriptcallback:", oxRemoteScript::m_sPipeNamePrefix);
+}
+
 TEST(OxRemoteScript, MessagesReachTheCallbackInTheirPlaces) {
     const struct {
         std::string message;

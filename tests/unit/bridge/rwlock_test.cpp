@@ -23,6 +23,8 @@ namespace {
 using std::chrono::milliseconds;
 using Operation = int (*)(RWLock&);
 
+static_assert(RWLock::RWLOCK_VALID == 16435934);
+
 int ReadLock(RWLock& lock) {
     return lock.ReadLock();
 }

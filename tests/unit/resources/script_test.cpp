@@ -144,6 +144,19 @@ TEST_F(OxResourceScript, FailedRunsGetTheScriptErrorPage) {
               testing::internal::GetCapturedStderr());
 }
 
+// Not only with the resource, which lives until the answer is sent.
+TEST_F(OxResourceScript, OutputOfAFailedRunIsClosedAndRemovedBeforeTheAnswer) {
+    m_home.Script("page.pl", "write-output half a page\nexit 3\n");
+    const auto request = Get("/page.pl");
+    const auto before = OpenDescriptors();
+    oxResource_Script resource(m_home.Path(), "", "", "", Echo);
+    const auto reply = resource.GetReply(*request);
+    EXPECT_EQ(&Http::INTERNAL_SERVER_ERROR_SCRIPT, &reply->GetStatus());
+    EXPECT_TRUE(resource.OutputFile().starts_with("./.oxscript:"));
+    EXPECT_TRUE(IsWorkEmpty());
+    EXPECT_EQ(before, OpenDescriptors());
+}
+
 TEST_F(OxResourceScript, WhichScriptAndWhichDirectory) {
     m_home.Script("sub/page.pl", "write-output sub\n");
     m_home.Script("page.pl", "write-output home\n");

@@ -376,6 +376,34 @@ TEST_F(oxUserBaseLoading, AFileThatCannotBeReadIsToldOncePerReason) {
     ASSERT_EQ(0, chmod(Directory().c_str(), 0700));
 }
 
+TEST_F(oxUserBaseLoading, AFileThatBecomesTooLargeIsToldOnceAndKeepsItsUser) {
+    WriteUser("alice.usr", "alice", "password=" + Sealed("secret") + "\npermissions=3");
+    oxUserBase users(Directory());
+    const std::string small = TextOf("alice.usr");
+    const std::string filling = "; " + std::string(oxUserFile::MAX_BYTES - small.size() - 3, 'x') + "\n";
+    const std::string line = "User file " + PathOf("alice.usr") + " cannot be read: File too large\n";
+    const auto load = [&] { EXPECT_TRUE(users.LoadAll()); };
+
+    Write("alice.usr", small + filling);
+    EXPECT_EQ("", StandardErrorOf(load)) << "the largest";
+    EXPECT_EQ("u1=alice&p1=3", ListOf(users));
+    Write("alice.usr", small + "x" + filling);
+    EXPECT_EQ(line, StandardErrorOf(load));
+    EXPECT_EQ("", StandardErrorOf(load));
+    EXPECT_EQ("u1=alice&p1=3", ListOf(users));
+    EXPECT_TRUE(users.Authenticate("alice", "secret", nullptr));
+    EXPECT_FALSE(users.Authenticate("alice", "", nullptr));
+    EXPECT_EQ("", StandardErrorOf([&] {
+                  EXPECT_FALSE(users.SetPermissions("alice", 4)) << "the file's text would be lost";
+                  EXPECT_FALSE(users.AddUser("alice", "x", 1, "", ""));
+              }));
+    EXPECT_TRUE(TextOf("alice.usr") == small + "x" + filling);
+    Write("alice.usr", small);
+    EXPECT_EQ("", StandardErrorOf(load));
+    EXPECT_TRUE(users.SetPermissions("alice", 4));
+    EXPECT_EQ("u1=alice&p1=4", ListOf(users));
+}
+
 TEST_F(oxUserBaseLoading, AnotherDirectoryBringsOtherUsers) {
     WriteUser("alice.usr", "alice");
     m_scratch.Write("others/bob.usr", "[UserInfo]\nusername=bob\n");

@@ -1,6 +1,7 @@
 // Files of users that cannot be used: their names are taken, and they are told of.
 #include <gtest/gtest.h>
 
+#include <functional>
 #include <string>
 #include <utility>
 #include <vector>
@@ -89,6 +90,38 @@ TEST_F(oxUserBaseUnusable, DeletingRemovesItsFiles) {
     EXPECT_TRUE(users.AddUser("alice", "secret", 2, "", ""));
     EXPECT_TRUE(users.Authenticate("alice", "secret", nullptr));
     EXPECT_EQ("u1=alice&p1=2&u2=carol&p2=1", ListOf(users));
+}
+
+// Whatever has no usable name is nobody's.
+TEST_F(oxUserBaseUnusable, NoOperationWithoutANameReachesNobodysFiles) {
+    Write("damaged.usr", "no settings\n");
+    Write("nosection.usr", "username=alice\n");
+    WriteUser("nameless.usr", "", "PlaintextPassword=x\npermissions=1");
+    Write("nokey.usr", "[UserInfo]\npermissions=1\n");
+    WriteUser("nul.usr", "a\0b"s);
+    Write("empty.usr", "");
+    WriteUser("carol.usr", "carol", "permissions=1");
+    const auto before = Texts();
+    const struct {
+        const char* operation;
+        std::function<bool(oxUserBase&)> call;
+    } CASES[] = {
+        {"AddUser", [](oxUserBase& users) { return users.AddUser("", "x", 1, "1", "/x"); }},
+        {"DeleteUser", [](oxUserBase& users) { return users.DeleteUser(""); }},
+        {"SetPermissions", [](oxUserBase& users) { return users.SetPermissions("", 2); }},
+        {"SetPassword", [](oxUserBase& users) { return users.SetPassword("", "x"); }},
+        {"SetText1", [](oxUserBase& users) { return users.SetText1("", "/x"); }},
+        {"SetText2", [](oxUserBase& users) { return users.SetText2("", "1"); }},
+        {"SaveUser", [](oxUserBase& users) { return users.SaveUser(""); }},
+    };
+    oxUserBase users(Directory());
+    const std::uint64_t generation = users.Generation();
+    for (const auto& c : CASES) {
+        EXPECT_FALSE(c.call(users)) << c.operation;
+        EXPECT_TRUE(before == Texts()) << c.operation;
+    }
+    EXPECT_EQ(generation, users.Generation());
+    EXPECT_EQ("u1=carol&p1=1", ListOf(users));
 }
 
 TEST_F(oxUserBaseUnusable, EachOpeningTellsOfItAndNoOtherReloadDoes) {

@@ -180,8 +180,25 @@ def test_a_wait_for_the_remote_service_lives_through_a_reset(site, service):
     expect_nothing_left(site, server)
 
 
+def test_a_reset_keeps_the_remote_service_of_the_start(site, service):
+    """Its address in the settings is read at the start only."""
+    other = RemoteService()
+    try:
+        server = site.serve()
+        site.main_ini.write_text(f"[interface]\nersaddress=127.0.0.1:{other.port}\n")
+        server.reset()
+        service.may_speak.set()
+        other.may_speak.set()
+        check_page(site.raw(request_text("/remote.pl")), b"0 done\n")
+        assert service.requests == [b"ctx|99|a=b|EOT"]
+        assert other.requests == []
+    finally:
+        other.close()
+    expect_nothing_left(site, server)
+
+
 def test_a_script_that_runs_during_a_reset_has_the_new_settings_afterwards(site, service):
-    """The patience with the service is read again; its address is that of the server's start."""
+    """The patience with the service is read again, both keys of it; its address is that of the server's start."""
     use_steps(site)
     site.configure(web={"ErsTimeout": LONG, "ErsRetries": 1})
     server = site.serve()
@@ -193,14 +210,14 @@ def test_a_script_that_runs_during_a_reset_has_the_new_settings_afterwards(site,
 
     running = Background(run, 1)
     wait_until(lambda: (site.root / "began").exists(), "the script runs")
-    site.configure(web={"ErsTimeout": 1})
+    site.configure(web={"ErsTimeout": 1, "ErsRetries": 3})
     site.main_ini.write_text("[interface]\nersaddress=\n")
     server.reset()
     before = time.monotonic()
     (site.root / "go").touch()
     running.join()
     assert answers == [(UNREACHABLE, f"statusdesc=Server is unavailable at 127.0.0.1:{service.port}.")]
-    assert 1 <= times[0] - before < 5 * SLOWDOWN
+    assert 3 <= times[0] - before < 15 * SLOWDOWN
     assert service.requests == [b"ctx|99|x|EOT"]
 
 

@@ -6,6 +6,7 @@ import random
 import re
 import resource
 import time
+from pathlib import Path
 
 import pytest
 
@@ -183,6 +184,30 @@ def test_1500_idle_connections_and_new_clients_are_answered_at_once(site):
     server.wait_idle()
     wait_until(lambda: len(descriptors(server.pid)) <= files, "all descriptors are closed")
     assert site.get("/hello.htm").status == 200
+
+
+def wake_ups(pid):
+    """How often any thread of the process has waited for something and got it."""
+    return sum(
+        int(line.split()[1])
+        for status in Path(f"/proc/{pid}/task").glob("*/status")
+        for line in status.read_text().splitlines()
+        if line.startswith("voluntary_ctxt_switches:")
+    )
+
+
+@pytest.mark.slow
+@pytest.mark.skipif(SANITIZER == "thread", reason="a thread of the sanitizer's own wakes up ten times a second")
+def test_an_idle_server_has_no_periodic_work(site, server):
+    def asleep():
+        before = wake_ups(server.pid)
+        time.sleep(0.3)
+        return wake_ups(server.pid) == before
+
+    wait_until(asleep, "the start is over")
+    before = wake_ups(server.pid)
+    time.sleep(7)  # the measured interval; work every two seconds would show three times
+    assert wake_ups(server.pid) - before < 3
 
 
 # The check of object types opens a pipe for each look at memory and takes its failure for a fault of the program.

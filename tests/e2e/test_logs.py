@@ -181,6 +181,7 @@ LEVELS = {
     7: ["Starting server", "Server stopping", "Daemon thread started", "HttpDaemon thread: connected"],
     9: ["Debug level is now 9.", "Starting server", "HttpDaemon thread: connected"],
 }
+LEVELS |= {level + 1: LEVELS[level] for level in (1, 3, 5, 7)}
 
 
 @pytest.mark.parametrize("level", sorted(LEVELS))

@@ -5,30 +5,18 @@
 #include <sys/syscall.h>
 
 #include <cerrno>
+#include <cstring>
 #include <list>
 #include <new>
 #include <thread>
 
+#include "http/injected.h"
 #include "http/serverfixture.h"
 #include "http/support_threads.h"
 
 namespace {
 
 using oxHttpDaemonTest = ServerFixture;
-
-// Puts a failing function into the socket table for one test. A server that uses it is stopped first.
-template <typename Function>
-class Injected {
-public:
-    Injected(Function& entry, Function replacement) : m_entry(entry), m_before(entry) { entry = replacement; }
-    ~Injected() { m_entry = m_before; }
-    Injected(const Injected&) = delete;
-    Injected& operator=(const Injected&) = delete;
-
-private:
-    Function& m_entry;
-    Function m_before;
-};
 
 TEST_F(oxHttpDaemonTest, PortZeroLetsTheSystemChoose) {
     settings.port = 0;
@@ -64,22 +52,76 @@ TEST_F(oxHttpDaemonTest, OptionsAreSetAndTheirFailureIsIgnored) {
     struct Call {
         int level;
         int name;
+        std::vector<int> value;
         bool operator==(const Call&) const = default;
     };
     static std::vector<Call> calls;
     calls.clear();
     const Injected failing(
-        oxSocket::m_lpfnsetsockopt, +[](int, int level, int name, const void*, socklen_t) {
-            calls.push_back({level, name});
+        oxSocket::m_lpfnsetsockopt, +[](int, int level, int name, const void* value, socklen_t length) {
+            Call call{level, name, std::vector<int>(length / sizeof(int))};
+            std::memcpy(call.value.data(), value, call.value.size() * sizeof(int));
+            calls.push_back(std::move(call));
             errno = ENOPROTOOPT;
             return -1;
         });
     ASSERT_TRUE(Start());
-    const std::vector<Call> expected = {
-        {IPPROTO_TCP, TCP_NODELAY}, {SOL_SOCKET, SO_REUSEADDR}, {SOL_SOCKET, SO_KEEPALIVE}, {SOL_SOCKET, SO_LINGER}};
+    const std::vector<Call> expected = {{IPPROTO_TCP, TCP_NODELAY, {1}},
+                                        {SOL_SOCKET, SO_REUSEADDR, {1}},
+                                        {SOL_SOCKET, SO_KEEPALIVE, {1}},
+                                        {SOL_SOCKET, SO_LINGER, {1, 30}}};
     ASSERT_GE(calls.size(), expected.size());
     EXPECT_EQ(std::vector<Call>(calls.begin(), calls.begin() + 4), expected);
     server->Stop();
+}
+
+TEST_F(oxHttpDaemonTest, BindIsTriedOnce) {
+    static int calls;
+    static socklen_t size;
+    calls = 0;
+    const Injected failing(
+        oxSocket::m_lpfnbind, +[](int, const sockaddr*, socklen_t length) {
+            ++calls;
+            size = length;
+            errno = EADDRINUSE;
+            return -1;
+        });
+    EXPECT_FALSE(Start());
+    EXPECT_EQ(server->GetStartError(), oxHttpServer::START_ADDRESS_IN_USE);
+    EXPECT_EQ(calls, 1);
+    EXPECT_EQ(size, 16u);
+}
+
+TEST_F(oxHttpDaemonTest, QueueHolds128Connections) {
+    static std::atomic<int> calls;
+    static std::atomic<int> others;
+    calls = others = 0;
+    const Injected counting(
+        oxSocket::m_lpfnlisten, +[](int descriptor, int backlog) {
+            ++calls;
+            others += backlog != 128;
+            return listen(descriptor, backlog);
+        });
+    ASSERT_TRUE(Start());
+    ASSERT_TRUE(WaitForMessage("HttpDaemon thread: waiting on 128 connections."));
+    server->Stop();
+    EXPECT_GT(calls, 0);
+    EXPECT_EQ(others, 0);
+}
+
+TEST_F(oxHttpDaemonTest, StateTellsHowTheLastRunEnded) {
+    {
+        const Injected failing(
+            oxSocket::m_lpfnbind, +[](int, const sockaddr*, socklen_t) {
+                errno = EACCES;
+                return -1;
+            });
+        EXPECT_FALSE(Start());
+    }
+    EXPECT_EQ(server->GetDaemonState(), -2);
+    ASSERT_TRUE(server->Start());
+    server->Stop();
+    EXPECT_EQ(server->GetDaemonState(), -1);
 }
 
 TEST_F(oxHttpDaemonTest, FailingListenEndsTheThreadOnErrorAndCanBeStartedAgain) {

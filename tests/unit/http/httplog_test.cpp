@@ -153,6 +153,21 @@ TEST(AccessLogLine, TimeIsLocalAndDayAndHourAreNotPadded) {
     }
 }
 
+TEST(AccessLogLine, MonthsAreEnglish) {
+    const Zone zone("UTC0");
+    const char* const months[] = {"Jan", "Feb", "Mar", "Apr", "May", "Jun", "Jul", "Aug", "Sep", "Oct", "Nov", "Dec"};
+    std::tm middle{};
+    middle.tm_year = 123;
+    middle.tm_mday = 15;
+    for (const char* month : months) {
+        std::tm when = middle;
+        const oxRequest request;
+        const std::string line = oxHttpServerLog::FormatLine(oxSockAddr(1U), request, nullptr, timegm(&when), 0);
+        EXPECT_NE(line.find(std::string(" [15/") + month + "/2023:0:00:00 "), std::string::npos) << line;
+        ++middle.tm_mon;
+    }
+}
+
 TEST(oxHttpServerLog, IsSilencedByNoDebugLevelAndHasNoStamp) {
     for (const int level : {0, 1, 9}) {
         Scratch dir;

@@ -88,6 +88,32 @@ TEST_F(oxHttpServerTest, OtherStartFailureGivesItsNumberAndCanBeRepeated) {
     EXPECT_TRUE(Start());
 }
 
+TEST_F(oxHttpServerTest, StartErrorIsThatOfTheLastStart) {
+    const std::uint32_t good = settings.port;
+    oxSocket other;
+    ASSERT_TRUE(other.Create(AF_INET, SOCK_STREAM, 0, "127.0.0.1", 0));
+    ASSERT_TRUE(other.Listen(1));
+    struct Case {
+        const char* address;
+        std::uint32_t port;
+        int error;
+        bool started;
+    };
+    const std::uint32_t taken = other.GetLocalAddress().Port();
+    for (const Case& c : {Case{"127.0.0.1", 0, -2, false},
+                          {"127.0.0.1", good, 0, true},
+                          {"127.0.0.1", taken, -1, false},
+                          {"192.0.2.1", good, 0, false},
+                          {"127.0.0.1", taken, -1, false},
+                          {"127.0.0.1", good, 0, true}}) {
+        settings.webAddress = c.address;
+        settings.port = c.port;
+        EXPECT_EQ(Start(), c.started) << c.address << " " << c.port;
+        EXPECT_EQ(server->GetStartError(), c.error) << c.address << " " << c.port;
+        server->Stop();
+    }
+}
+
 TEST_F(oxHttpServerTest, AccessLogThatCannotBeOpenedDoesNotStopTheStart) {
     settings.logFileName = "none/access";
     testing::internal::CaptureStderr();
@@ -182,6 +208,19 @@ TEST_F(oxHttpServerTest, ConnectionIsKeptUntilTheTimeoutHasPassed) {
     EXPECT_EQ(Count("has timed-out"), 0);
     idle.Send("GET / HTTP/1.0\r\n\r\n");
     EXPECT_NE(idle.ReadAll().find("home"), std::string::npos);
+}
+
+TEST_F(oxHttpServerTest, TimeBeforeTheConnectionDoesNotCount) {
+    settings.sessionTimeout = 30;
+    ASSERT_TRUE(Start());
+    ASSERT_TRUE(WaitForMessage("accepting connection:"));
+    clock.Advance(31);
+    Client late(settings.port);
+    ASSERT_TRUE(WaitForMessage("Adding user session"));
+    Poke();
+    EXPECT_EQ(Count("has timed-out"), 0);
+    late.Send("GET / HTTP/1.0\r\n\r\n");
+    EXPECT_NE(late.ReadAll().find("home"), std::string::npos);
 }
 
 TEST_F(oxHttpServerTest, TickRemovesTimedOutSessionsButNotFinishedOnes) {

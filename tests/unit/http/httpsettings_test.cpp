@@ -2,7 +2,32 @@
 
 #include <gtest/gtest.h>
 
+#include "http/httpserver.h"
+
 namespace {
+
+TEST(oxHttpSettings, NamesAndDefaultTexts) {
+    const struct {
+        const char* name;
+        const char* text;
+    } cases[] = {
+        {oxHttpServer::m_sINI_KEY_WEB_ADDRESS, "WebAddress"},
+        {oxHttpServer::m_sINI_KEY_WEB_PORT, "WebPort"},
+        {oxHttpServer::m_sINI_KEY_LOG_FILE_NAME, "WebLogFileName"},
+        {oxHttpServer::m_sINI_KEY_WEB_LOGGING, "WebLogging"},
+        {oxHttpServer::m_sINI_KEY_USER_TIMEOUT, "WebUserTimeout"},
+        {oxHttpServer::m_sINI_KEY_LOG_ERRORS, "WebLogErrors"},
+        {oxHttpServer::m_sINI_KEY_LOG_ERROR_FILE, "WebErrorLog"},
+        {oxHttpServer::m_sINI_KEY_MAX_SESSIONS_PER_ADDRESS, "WebMaxConnectionsPerAddress"},
+        {oxHttpServer::m_sINI_KEY_NO_CACHE, "WebNoCache"},
+        {oxHttpServer::m_sINI_KEY_SCRIPT_TIMEOUT, "WebScriptTimeout"},
+        {oxHttpServer::m_sDEFAULT_LOG_FILE_NAME, "ox_remote.log"},
+        {oxHttpServer::m_sERROR_LOG_NAME, "ox_remote.err"},
+        {oxHttpServer::m_sDEFAULT_WEB_ADDRESS, ""},
+    };
+    for (const auto& c : cases)
+        EXPECT_STREQ(c.name, c.text);
+}
 
 oxHttpSettings Read(const std::string& text) {
     oxConfig config;
@@ -38,6 +63,12 @@ TEST(oxHttpSettings, EveryKeyIsRead) {
     EXPECT_EQ(s.logFileName, "a.log");
     EXPECT_TRUE(s.noCache);
     EXPECT_EQ(s.maxSessionsPerAddress, 2);
+}
+
+TEST(oxHttpSettings, MessageLogAlwaysHasAName) {
+    const oxHttpSettings s = Read("WebErrorLog=\nWebLogFileName=\n");
+    EXPECT_EQ(s.errorLogName, "ox_remote.err");
+    EXPECT_EQ(s.logFileName, "") << "without a name no access log is kept";
 }
 
 TEST(oxHttpSettings, TimeoutIsNeverBelowThirtySeconds) {

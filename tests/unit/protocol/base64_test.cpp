@@ -68,6 +68,8 @@ TEST(OxBase64, EncodeFillsTheLastGroup) {
     };
     for (const auto& c : CASES) {
         EXPECT_EQ(c.text, oxBase64::Encode(c.bytes));
+        const void* const bytes = c.bytes.data();
+        EXPECT_EQ(c.text, oxBase64::Encode(bytes, c.bytes.size()));
         const std::size_t room = 4 * ((c.bytes.size() + 2) / 3) + 1;
         const auto out = std::make_unique<char[]>(room);
         std::memset(out.get(), '#', room);

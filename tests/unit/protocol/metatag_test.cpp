@@ -3,6 +3,7 @@
 #include <memory>
 #include <string>
 
+#include "protocol/nomemory.h"
 #include "protocol/reply.h"
 
 using namespace std::string_literals;
@@ -59,6 +60,9 @@ TEST(MetaTag, Table) {
         {"value not ended", Head(R"(<meta http-equiv="Content-Type" content="a/b>)"), ""},
         {"value empty", Head(TAG + R"(<meta http-equiv="Content-Type" content="">)"), ""},
         {"value holds the end of a tag", Head(R"(<meta http-equiv="Content-Type" content="a>b">)"), "a>b"},
+        {"value runs on to the next quote",
+         Head(R"(<meta http-equiv="content-type" content="a>< meta http-equiv="content-type" content="c/d">)"),
+         "a>< meta http-equiv="},
         {"later one wins", Head(TAG + R"(<meta http-equiv="Content-Type" content="a/b">)"), "a/b"},
         {"later broken one does not", Head(TAG + R"(<meta http-equiv="Content-Type" content=")"), TYPE},
         {"behind other tags", Head("<title>x</title><meta name=\"a\" content=\"b\">" + TAG), TYPE},
@@ -98,6 +102,18 @@ TEST(MetaTag, Only2000BytesAreScanned) {
     EXPECT_EQ(TYPE, Scan(std::string(2000 - used, ' ') + page));
     EXPECT_EQ("", Scan(std::string(2001 - used, ' ') + page));
     EXPECT_EQ("", Scan("<head>" + std::string(2000, ' ') + TAG + "</head>"));
+}
+
+TEST(MetaTag, HeadOfAnyLengthNeedsNoMemory) {
+    const std::string page =
+        "<head>" + std::string(1900, ' ') + R"(<meta http-equiv="Content-Type" content="A/B">)" + "</head>";
+    ASSERT_LE(page.size(), 2000u);
+    oxReply reply(Http::OK_200);
+    {
+        const NoMemory none;
+        reply.ScanForMetaTags(page.data(), page.size());
+    }
+    EXPECT_EQ("a/b", reply.GetContentTypeOverride());
 }
 
 TEST(MetaTag, EmptyTypeStandsForTheFilesOwn) {

@@ -265,6 +265,26 @@ TEST(OxReply, DrainsWithElevenReadsAtMost) {
     EXPECT_EQ(OkHeader("text/html") + "body", sent.text);
 }
 
+TEST(OxReply, DrainEndsWithTheFirstReceiveThatIsNotFull) {
+    static int calls;
+    for (const ssize_t last : {ssize_t{65534}, ssize_t{1}, ssize_t{0}, ssize_t{-1}}) {
+        static ssize_t third;
+        calls = 0;
+        third = last;
+        oxSocket::m_lpfnrecv = [](int, void*, size_t length, int) {
+            if (++calls != 3)
+                return static_cast<ssize_t>(length);
+            errno = EAGAIN;
+            return third;
+        };
+        oxReply reply(Http::OK_200, Http::TYPE_HTML, FileOf("body"), 4, nullptr);
+        const Sent sent = Send(reply);
+        oxSocket::m_lpfnrecv = ::recv;
+        EXPECT_EQ(3, calls) << last;
+        EXPECT_EQ(OkHeader("text/html") + "body", sent.text) << last;
+    }
+}
+
 TEST(OxReply, ErrorStatusesDoNotDrain) {
     Connection connection;
     LineLog log;

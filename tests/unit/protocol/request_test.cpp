@@ -374,6 +374,60 @@ TEST(OxRequest, ParseOfNothingIsBad) {
     EXPECT_FALSE(request.Parse());
 }
 
+TEST(OxRequest, ParseAfterAFailedReadLeavesItsStatus) {
+    Connection connection;
+    LineLog log;
+    oxRequest request;
+    ASSERT_TRUE(connection.PeerSend(HEAD + "X: " + std::string(40000, 'x')));
+    ASSERT_FALSE(request.Read(connection.Server(), log));
+    EXPECT_FALSE(request.Parse());
+    EXPECT_EQ(Outcome{.status = -3}, Collect(false, request));
+}
+
+// A request object takes one connection after the other: nothing of the last one is left in a bad one.
+TEST(OxRequest, SecondRequestThatIsBadHasNoPathAndNoQuery) {
+    for (const char* second : {"BREW /c?d HTTP/1.0\r\n\r\n", "GET c?d HTTP/1.0\r\n\r\n", "GET\r\n\r\n"}) {
+        LineLog log;
+        oxRequest request;
+        Connection first;
+        ASSERT_TRUE(first.PeerSend("GET /a?b HTTP/1.0\r\n\r\n"));
+        ASSERT_TRUE(request.Read(first.Server(), log) && request.Parse());
+        EXPECT_EQ("/a", request.GetPath());
+        EXPECT_EQ("b", request.GetQueryString());
+        Connection next;
+        ASSERT_TRUE(next.PeerSend(second));
+        ASSERT_TRUE(request.Read(next.Server(), log));
+        EXPECT_FALSE(request.Parse()) << second;
+        EXPECT_EQ(oxRequest::STATUS_BAD, request.GetStatus()) << second;
+        EXPECT_EQ("", request.GetPath()) << second;
+        EXPECT_EQ("", request.GetQueryString()) << second;
+    }
+}
+
+TEST(OxRequest, WhatIsNotThereIsNull) {
+    const struct {
+        const char* text;
+        bool hasUrl;
+        bool hasBody;
+    } cases[] = {
+        {"POST /run HTTP/1.0\r\nContent-Length: 1\r\n\r\nx", true, true},
+        {"POST /run HTTP/1.0\r\nContent-Length: 0\r\n\r\nx", true, false},
+        {"POST /run HTTP/1.0\r\n\r\nx", true, false},
+        {"GET index.html HTTP/1.0\r\n\r\n", false, false},
+        {"BREW /c HTTP/1.0\r\n\r\n", false, false},
+    };
+    for (const auto& c : cases) {
+        Connection connection;
+        LineLog log;
+        oxRequest request;
+        ASSERT_TRUE(connection.PeerSend(c.text));
+        ASSERT_TRUE(request.Read(connection.Server(), log));
+        request.Parse();
+        EXPECT_EQ(c.hasUrl, request.GetRawPath().data() != nullptr) << c.text;
+        EXPECT_EQ(c.hasBody, request.GetBody().data() != nullptr) << c.text;
+    }
+}
+
 TEST(OxRequest, MethodNames) {
     const struct {
         const char* text;

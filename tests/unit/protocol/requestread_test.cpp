@@ -10,6 +10,7 @@
 #include <string_view>
 #include <thread>
 
+#include "protocol/nomemory.h"
 #include "protocol/request.h"
 #include "protocol/testsockets.h"
 
@@ -195,6 +196,68 @@ TEST(OxRequestRead, DrainsWithElevenReadsAtMost) {
     EXPECT_EQ((ReadResult{false, -4, false, ""}), Read(connection.Server(), log));
     EXPECT_EQ(11, drains);
     EXPECT_EQ(2 + 11, calls);
+}
+
+TEST(OxRequestRead, DrainEndsWithTheFirstReceiveThatIsNotFull) {
+    static int calls;
+    static ssize_t third;
+    const auto full = static_cast<ssize_t>(oxRequestLimits::INLINE_BUFFER);
+    for (const ssize_t last : {full - 1, ssize_t{1}, ssize_t{0}, ssize_t{-1}}) {
+        calls = 0;
+        third = last;
+        const RecvStub stub([](int, void* buffer, size_t length, int) {
+            constexpr int FILLS = 2;  // of the inline buffer and of the large one
+            const std::string header = HeaderBlock(1000, LengthHeader("40000"));
+            if (calls == 0)
+                std::memcpy(buffer, header.data(), header.size());
+            if (++calls != FILLS + 3)
+                return static_cast<ssize_t>(length);
+            errno = EAGAIN;
+            return third;
+        });
+        Connection connection;
+        LineLog log;
+        EXPECT_EQ((ReadResult{false, -4, false, ""}), Read(connection.Server(), log)) << last;
+        EXPECT_EQ(2 + 3, calls) << last;
+    }
+}
+
+bool ReadWithoutMemory(oxRequest& request, oxSocket& socket, LineLog& log) {
+    const NoMemory none;
+    return request.Read(socket, log);
+}
+
+TEST(OxRequestRead, WithoutMemoryForTheLargeBufferTheRequestIsTooLarge) {
+    Connection connection;
+    LineLog log;
+    ASSERT_TRUE(connection.PeerSend(HeaderBlock(1000, LengthHeader("40000")) + std::string(40000, 'b')));
+    oxRequest request;
+    EXPECT_FALSE(ReadWithoutMemory(request, connection.Server(), log));
+    EXPECT_EQ(oxRequest::STATUS_TOO_LARGE, request.GetStatus());
+    EXPECT_TRUE(log.Lines().empty());
+}
+
+TEST(OxRequestRead, WithoutMemoryAUsualRequestIsRead) {
+    for (const std::string& text : {HeaderBlock(LIMIT), HeaderBlock(1000, LengthHeader("5000")) + Bytes(5000)}) {
+        Connection connection;
+        LineLog log;
+        ASSERT_TRUE(connection.PeerSend(text));
+        oxRequest request;
+        EXPECT_TRUE(ReadWithoutMemory(request, connection.Server(), log));
+        EXPECT_TRUE(request.IsComplete());
+    }
+}
+
+TEST(OxRequestRead, WaitThatFailsIsASocketError) {
+    const RecvStub stub([](int handle, void*, size_t, int) {
+        ::close(handle);  // below the socket, which does not know
+        errno = EAGAIN;
+        return ssize_t{-1};
+    });
+    Connection connection;
+    LineLog log;
+    EXPECT_EQ((ReadResult{false, -2, false, ""}), Read(connection.Server(), log));
+    EXPECT_EQ(std::vector<std::string>{"Error reading request from socket - socket error = 9"}, log.Lines());
 }
 
 TEST(OxRequestRead, ErrorTable) {

@@ -79,7 +79,11 @@ TEST(oxAuditFile, LevelDecidesWhatIsWritten) {
                           {0, 1, false},
                           {0, -1, false},
                           {1, 0, true},
-                          {10, 10, true}}) {
+                          {10, 10, true},
+                          {-1, -2, true},
+                          {-1, -1, true},
+                          {-1, 0, false},
+                          {-1, 1, false}}) {
         Scratch dir;
         oxAuditFile log(dir.File("l.log").c_str(), "a");
         log.SetDebugLevel(c.level);
@@ -90,12 +94,15 @@ TEST(oxAuditFile, LevelDecidesWhatIsWritten) {
     }
 }
 
-TEST(oxAuditFile, LevelZeroSilencesUnconditionalLinesToo) {
-    Scratch dir;
-    oxAuditFile log(dir.File("z.log").c_str(), "a");
-    log.SetDebugLevel(0);
-    log.Printf("nothing");
-    EXPECT_EQ(dir.Read("z.log"), "");
+TEST(oxAuditFile, OnlyLevelZeroSilencesUnconditionalLines) {
+    for (const int level : {-9, -1, 0, 1, 9}) {
+        Scratch dir;
+        oxAuditFile log(dir.File("z.log").c_str(), "a");
+        log.SetDebugLevel(level);
+        const std::size_t before = dir.Lines("z.log").size();
+        log.Printf("unconditional");
+        EXPECT_EQ(dir.Lines("z.log").size(), before + (level == 0 ? 0 : 1)) << level;
+    }
 }
 
 TEST(oxAuditFile, SetDebugLevelWritesItsLineAtLevelNine) {

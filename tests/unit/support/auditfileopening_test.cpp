@@ -1,9 +1,12 @@
 // Where a log file is opened, and what becomes of the one that was open.
 #include <gtest/gtest.h>
 
+#include <algorithm>
 #include <cerrno>
+#include <chrono>
 #include <filesystem>
 #include <string>
+#include <thread>
 
 #include "support/auditfile.h"
 #include "testing/scratch.h"
@@ -27,6 +30,66 @@ private:
     std::string m_default;
     fs::path m_working;
 };
+
+using std::chrono::milliseconds;
+using std::chrono::steady_clock;
+
+struct Opening {
+    bool opened;
+    milliseconds took;
+};
+
+// Opens a log in a directory that is made that long after the open began.
+Opening OpenIn(milliseconds directoryAfter) {
+    const Scratch dir;
+    oxAuditFile log;
+    testing::internal::CaptureStderr();
+    const auto begin = steady_clock::now();
+    std::jthread maker([&] {
+        std::this_thread::sleep_until(begin + directoryAfter);
+        fs::create_directory(dir.File("late"));
+    });
+    const bool opened = log.Open(dir.File("late/x.log").c_str(), "a");
+    const auto took = std::chrono::ceil<milliseconds>(steady_clock::now() - begin);
+    testing::internal::GetCapturedStderr();
+    return {opened, took};
+}
+
+// A machine that is busy may hold up either side; a rule that is broken fails each time.
+constexpr int REPEATS = 5;
+
+TEST(oxAuditFile, ADirectoryThatAppearsBeforeTheThirdTryIsInTime) {
+    bool opened = false;
+    for (int i = 0; i < REPEATS && !opened; ++i)
+        opened = OpenIn(milliseconds(1300)).opened;
+    EXPECT_TRUE(opened);
+}
+
+TEST(oxAuditFile, ADirectoryThatAppearsBehindTheThirdTryIsTooLate) {
+    bool refused = false;
+    for (int i = 0; i < REPEATS && !refused; ++i) {
+        const Opening opening = OpenIn(milliseconds(2500));
+        refused = !opening.opened && opening.took < milliseconds(3900);
+    }
+    EXPECT_TRUE(refused);
+}
+
+TEST(oxAuditFile, AStreamIsRedirectedInOneTry) {
+    const Scratch dir;
+    milliseconds shortest = milliseconds::max();
+    for (int i = 0; i < REPEATS && shortest > milliseconds(900); ++i) {
+        std::FILE* stream = std::fopen(dir.File("before").c_str(), "a");
+        ASSERT_NE(stream, nullptr);
+        oxAuditFile log;
+        testing::internal::CaptureStderr();
+        const auto begin = steady_clock::now();
+        EXPECT_FALSE(log.Open(dir.File("none/x.log").c_str(), "a", stream));
+        shortest = std::min(shortest, std::chrono::ceil<milliseconds>(steady_clock::now() - begin));
+        EXPECT_EQ(testing::internal::GetCapturedStderr(), "oxAuditFile error: No such file or directory\n");
+        std::fclose(stream);
+    }
+    EXPECT_LT(shortest, milliseconds(900));
+}
 
 TEST(oxAuditFile, AnEmptyDefaultDirectoryBecomesTheAbsoluteWorkingDirectory) {
     const Scratch dir;

@@ -4,6 +4,7 @@ import errno
 import fcntl
 import os
 import re
+import resource
 import select
 import signal
 import socket
@@ -17,6 +18,7 @@ from harness import (
     BANNER,
     DEAD_PID,
     INVALID,
+    SANITIZER,
     SLOWDOWN,
     STATUS_NOTICE,
     USAGE,
@@ -218,6 +220,18 @@ def test_a_start_that_fails_in_the_background(site):
         site.expect("status", re.escape(line), times=1)
     site.expect("err", r"Socket bind failed: Address already in use \(98\)", times=1)
     site.expect("err", re.escape(port_in_use_line(port)), times=1)
+
+
+@pytest.mark.skipif(SANITIZER != "", reason="a sanitizer needs a thread of its own")
+def test_a_system_that_gives_no_process_fails_the_start_without_a_word(site):
+    """And at once; the next switch is carried out."""
+    site.use_ordinary_user()
+    limits = {"preexec_fn": lambda: resource.setrlimit(resource.RLIMIT_NPROC, (1, 1))}
+    assert site.run("-start", **limits) == (1, BANNER)
+    assert site.run("-start", "-stop", **limits) == (1, BANNER + not_running(2))
+    assert site.leftover_processes() == []
+    assert site.status() == [] and site.err() == []
+    assert not site.pid_file.exists()
 
 
 def test_signals_reach_the_daemon(site):

@@ -395,6 +395,13 @@ TEST_F(OxAsynchSocket, SmallerTimeLimitEndsTheThreadWithoutAnEvent) {
     struct Limited {
         Recorder socket;
         steady_clock::time_point start;
+        steady_clock::time_point end;
+
+        bool HasEnded() {
+            if (end == steady_clock::time_point() && !socket.IsSelecting())
+                end = steady_clock::now();
+            return end != steady_clock::time_point();
+        }
     };
     std::vector<std::unique_ptr<Limited>> all;
     for (const auto& test : CASES) {
@@ -408,10 +415,10 @@ TEST_F(OxAsynchSocket, SmallerTimeLimitEndsTheThreadWithoutAnEvent) {
         EXPECT_TRUE(limited.socket.SetAsyncSelect(READ));
     }
     EXPECT_TRUE(Eventually(
-        [&] { return std::none_of(all.begin(), all.end(), [](auto& one) { return one->socket.IsSelecting(); }); },
+        [&] { return std::count_if(all.begin(), all.end(), [](auto& one) { return !one->HasEnded(); }) == 0; },
         seconds(8)));
     for (const auto& limited : all) {
-        EXPECT_GE(steady_clock::now() - limited->start, seconds(1));
+        EXPECT_GE(limited->end - limited->start, seconds(1));
         EXPECT_EQ(0u, limited->socket.Total());
         EXPECT_EQ(0, limited->socket.ErrorCode());
         EXPECT_NE(-1, limited->socket.GetHandle());
@@ -507,6 +514,45 @@ TEST_F(OxAsynchSocket, HandlerMayCloseTheSocket) {
     EXPECT_TRUE(m_socket.WaitUntilEnded());
     EXPECT_EQ(std::vector<std::string>{"OnWrite 2"}, m_socket.Events());
     EXPECT_EQ(-1, m_socket.GetHandle());
+}
+
+TEST_F(OxAsynchSocket, HandlerThatClosesOnlyTheDescriptorGetsNoFurtherEventOfItsRound) {
+    static const struct {
+        const char* closesOn;
+        std::vector<std::string> events;
+    } CASES[] = {
+        {"OnWrite", {"OnWrite 3"}},
+        {"OnRead", {"OnWrite 3", "OnRead 3"}},
+        {"OnOutOfBand", {"OnWrite 3", "OnRead 3", "OnOutOfBand 3"}},
+    };
+    struct Pair {
+        oxSocket peer;
+        Recorder socket;
+    };
+    const oxSockAddr address = ListenOnLoopback(m_listener);
+    std::vector<std::unique_ptr<Pair>> pairs;
+    for (const auto& test : CASES) {
+        auto& [peer, socket] = *pairs.emplace_back(std::make_unique<Pair>());
+        ASSERT_TRUE(socket.oxSocket::Create(AF_INET, SOCK_STREAM, 0));
+        ASSERT_TRUE(socket.oxSocket::Connect(address.Raw(), oxSockAddr::LENGTH));
+        ASSERT_TRUE(m_listener.Accept(peer, nullptr, nullptr));
+        EXPECT_EQ(4, peer.Send("data", -1, 0));
+        EXPECT_EQ(1, peer.Send("!", 1, MSG_OOB));
+        pollfd entry{socket.GetHandle(), POLLIN | POLLPRI, 0};
+        ASSERT_TRUE(Eventually([&] { return ::poll(&entry, 1, 0) >= 0 && entry.revents == (POLLIN | POLLPRI); }));
+        socket.onEvent = [&test](Recorder& self, const std::string& event) {
+            if (event == test.closesOn) {
+                EXPECT_TRUE(self.oxSocket::Close());
+            }
+        };
+        socket.SetTimeLimitA(1);  // the mask stays as it is to the thread's end
+        EXPECT_TRUE(socket.SetAsyncSelect(READ | WRITE | OUT_OF_BAND));
+    }
+    for (std::size_t i = 0; i < pairs.size(); ++i) {
+        EXPECT_TRUE(pairs[i]->socket.WaitUntilEnded());
+        EXPECT_EQ(CASES[i].events, pairs[i]->socket.Events());
+        EXPECT_EQ(-1, pairs[i]->socket.GetHandle());
+    }
 }
 
 TEST_F(OxAsynchSocket, CloseWaitsForARunningHandler) {

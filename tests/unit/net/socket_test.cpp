@@ -472,7 +472,9 @@ TEST_F(OxSocket, AcceptFillsTheOther) {
     for (const bool ownAccept : {true, false}) {
         oxSocket::m_lpfnaccept = ownAccept ? ::accept : PlainAccept;
         oxSocket listener, client, accepted;
-        const oxSockAddr address = ListenOnLoopback(listener);
+        ASSERT_TRUE(listener.Create(AF_INET, SOCK_STREAM, IPPROTO_TCP, "127.0.0.1", 0));
+        ASSERT_TRUE(listener.Listen(1));
+        const oxSockAddr address = listener.GetLocalAddress();
         ASSERT_TRUE(client.Create(AF_INET, SOCK_STREAM, 0));
         ASSERT_TRUE(client.Connect(address.Raw(), oxSockAddr::LENGTH));
         EXPECT_FALSE(listener.SetSockOpt(SOL_SOCKET, -1, nullptr, 0));
@@ -484,7 +486,7 @@ TEST_F(OxSocket, AcceptFillsTheOther) {
         EXPECT_EQ(LOOPBACK, peer.Address());
         EXPECT_EQ(AF_INET, accepted.GetFamily());
         EXPECT_EQ(SOCK_STREAM, accepted.GetType());
-        EXPECT_EQ(0, accepted.GetProtocol());
+        EXPECT_EQ(IPPROTO_TCP, accepted.GetProtocol());
         EXPECT_TRUE(IsClosedOnExec(accepted.GetHandle()));
         ASSERT_EQ(5, client.Send("hello", 5, 0));
         EXPECT_EQ("hello", Receive(accepted, 5));

@@ -53,6 +53,12 @@ hostent* FindLongAddress(const char* name) {
     return entry;
 }
 
+hostent* FindShortAddress(const char* name) {
+    hostent* entry = FindTwoAddresses(name);
+    entry->h_length = 2;
+    return entry;
+}
+
 hostent* FindEmptyList(const char* name) {
     hostent* entry = FindTwoAddresses(name);
     static char* list[] = {nullptr};
@@ -209,6 +215,11 @@ TEST_F(OxSockAddr, LongAddressDoesNotPassItsPlace) {
     EXPECT_EQ(0, std::memcmp(reinterpret_cast<const char*>(address.Raw()) + 8, zeros, sizeof zeros));
 }
 
+TEST_F(OxSockAddr, ShortAddressLeavesTheOtherBytesAllOnes) {
+    oxSocket::m_lpfngethostbyname = FindShortAddress;
+    EXPECT_EQ("192.0.255.255", oxSockAddr("some.example", 80).Dotted());
+}
+
 TEST_F(OxSockAddr, HostNameOfZeroIsUnknownWithoutLookUp) {
     oxSocket::m_lpfngethostbyaddr = NameByAddress;
     s_addressLength = 0;
@@ -222,6 +233,9 @@ TEST_F(OxSockAddr, HostNameIsTheOfficialNameOrEmpty) {
     EXPECT_STREQ("some.example", oxSockAddr(0xc0000207, 80, AF_INET).HostName());
     EXPECT_EQ(std::string("\xc0\x00\x02\x07", 4), s_addressBytes);
     EXPECT_EQ(AF_INET, s_addressFamily);
+    EXPECT_STREQ("some.example", oxSockAddr(0xc0000207, 80, AF_INET6).HostName());
+    EXPECT_EQ(4u, s_addressLength);
+    EXPECT_EQ(AF_INET6, s_addressFamily);
     oxSocket::m_lpfngethostbyaddr = NoNameByAddress;
     EXPECT_STREQ("", oxSockAddr(0xc0000207).HostName());
     oxSocket::m_lpfngethostbyaddr = EntryWithoutName;

@@ -1,10 +1,12 @@
 #include "protocol/httptime.h"
 
 #include <gtest/gtest.h>
+#include <unistd.h>
 
 #include <algorithm>
 #include <cstdlib>
 #include <cstring>
+#include <functional>
 #include <limits>
 #include <memory>
 #include <optional>
@@ -54,6 +56,8 @@ const struct {
     {"Sunday, 06-Nov-94 08:49:37 GMT", 784111777},
     {"Sun Nov  6 08:49:37 1994", 784111777},
     {"Sun Nov 16 08:49:37 1994", 784975777},
+    {"Sun Nov   6 08:49:37 1994", 784111777},  // the clock time stands one further, too
+    {"Tue Nov  6 08:49:37 1900", -2182259423},
     {"Thu, 01 Jan 1970 00:00:00 GMT", 0},
     {"Thu, 01 Jan 1970 00:00:01 GMT", 1},
     {"Sun, 01 Jul 2012 12:00:00 GMT", 1341144000},
@@ -183,6 +187,38 @@ TEST(OxHttpTime, YearThatCannotBeWrittenGivesNoText) {
     std::string text = "x";
     time.Format(text);
     EXPECT_EQ("x", text);
+}
+
+// In a process of its own, where nothing has read the zone yet.
+TEST(OxHttpTimeDeathTest, TheFirstClockOrTextTakesTheZoneAndNoLaterOneDoes) {
+    GTEST_FLAG_SET(death_test_style, "threadsafe");
+    static constexpr long UNREAD = 3600;
+    static constexpr long READ = 18000;
+    static const auto zoneAfter = [](const char* zone, auto&& make) {
+        ::setenv("TZ", zone, 1);
+        make();
+        return ::timezone;
+    };
+    static const std::function<void()> TAKERS[] = {
+        [] { oxHttpTime(); },
+        [] { oxHttpTime("x"); },
+        [] { oxHttpTime(std::string("x")); },
+    };
+    for (const auto& taker : TAKERS) {
+        const auto rounds = [&taker] {
+            ::setenv("TZ", "AAA1", 1);
+            ::tzset();
+            if (zoneAfter("BBB5", [] { oxHttpTime(std::time_t{0}); }) != UNREAD)
+                ::_exit(1);
+            if (zoneAfter("BBB5", taker) != READ)
+                ::_exit(2);
+            for (const auto& later : TAKERS)
+                if (zoneAfter("CCC-3", later) != READ)
+                    ::_exit(3);
+            ::_exit(0);
+        };
+        EXPECT_EXIT(rounds(), testing::ExitedWithCode(0), "") << &taker - TAKERS;
+    }
 }
 
 TEST(OxHttpTime, BrokenDownTimeIsLocal) {

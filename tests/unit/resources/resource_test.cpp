@@ -2,6 +2,8 @@
 
 #include <gtest/gtest.h>
 
+#include "testing/manualclock.h"
+
 namespace {
 
 TEST(OxResourceInvalid, AnswersWithItsStatus) {
@@ -23,6 +25,17 @@ TEST(OxResourceInvalid, AnswersWithItsStatus) {
         EXPECT_EQ(0u, reply->GetContentSize());
         EXPECT_TRUE(reply->ComposeHeader().starts_with(c.beginning)) << reply->ComposeHeader();
     }
+}
+
+TEST(OxResourceInvalid, NotModifiedDoesNotSayWhenItExpires) {
+    const ManualClock clock;
+    const oxRequest request;
+    const auto reply = oxResource_Invalid(Http::NOT_MODIFIED_304, nullptr).GetReply(request);
+    reply->SetClock(clock);
+    EXPECT_EQ(
+        "HTTP/1.0 304 Not Modified\r\nDate: Sun, 06 Nov 1994 08:49:37 GMT\r\n"
+        "Server: Orvex HTTP Server V3.5c\r\n\r\n",
+        reply->ComposeHeader());
 }
 
 TEST(OxResourceInvalid, TakesAStatusFromAnywhere) {

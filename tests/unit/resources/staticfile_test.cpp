@@ -2,6 +2,7 @@
 
 #include <fcntl.h>
 #include <gtest/gtest.h>
+#include <sys/resource.h>
 #include <sys/stat.h>
 #include <unistd.h>
 
@@ -24,11 +25,11 @@ constexpr std::time_t MODIFIED_SECONDS = 536457600;
 
 class OxResourceStaticFile : public testing::Test {
 protected:
-    void Write(const std::string& name, const std::string& content) const {
+    void Write(const std::string& name, const std::string& content, std::time_t modified = MODIFIED_SECONDS) const {
         const UniqueFd file = OpenFile(m_root + name, O_WRONLY | O_CREAT | O_TRUNC, 0644);
         ASSERT_TRUE(file);
         ASSERT_TRUE(WriteAll(file.Get(), content.data(), content.size()));
-        const timespec times[2] = {{MODIFIED_SECONDS, 999999999}, {MODIFIED_SECONDS, 999999999}};
+        const timespec times[2] = {{modified, 999999999}, {modified, 999999999}};
         ASSERT_EQ(0, ::futimens(file.Get(), times));
     }
 
@@ -130,6 +131,35 @@ TEST_F(OxResourceStaticFile, Table) {
         EXPECT_EQ(c.expected, Ask(c.path, c.since, c.ignore).text) << c.path << " " << c.since << " " << c.ignore;
 }
 
+// A condition that is no date counts as the first second of 1970; none, or an empty one, asks for nothing.
+TEST_F(OxResourceStaticFile, ConditionsOnFilesOf1970AndBefore) {
+    static constexpr const char* EMPTY = "\r\nX: y";  // the header has no value; another stands behind it
+    const struct {
+        std::time_t modified;
+        const char* since;
+        const char* status;
+    } cases[] = {
+        {0, "", "200 OK"},
+        {0, EMPTY, "200 OK"},
+        {0, " ", "304 Not Modified"},
+        {0, "no date", "304 Not Modified"},
+        {0, "Thu, 01 Jan 1970 00:00:00 GMT", "304 Not Modified"},
+        {0, "Wed, 31 Dec 1969 23:59:59 GMT", "200 OK"},
+        {1, "no date", "200 OK"},
+        {-1, "", "200 OK"},
+        {-1, EMPTY, "200 OK"},
+        {-1, "no date", "304 Not Modified"},
+        {-1, "Wed, 31 Dec 1969 23:59:59 GMT", "304 Not Modified"},
+        {-1, "Wed, 31 Dec 1969 23:59:58 GMT", "200 OK"},
+    };
+    for (const auto& c : cases) {
+        Write("/old.htm", "old", c.modified);
+        const std::string text = Ask("/old.htm", c.since).text;
+        EXPECT_TRUE(text.starts_with(std::string("HTTP/1.0 ") + c.status + "\r\n"))
+            << c.modified << " " << c.since << ": " << text;
+    }
+}
+
 TEST_F(OxResourceStaticFile, RootAndPathAreJoinedAsTheyStand) {
     Write("/plain", "plain");
     EXPECT_EQ(Ok("", "plain"), AskRoot(m_root + "/", "/plain").text);
@@ -161,6 +191,28 @@ TEST_F(OxResourceStaticFile, FileThatMayNotBeOpenedIsNotFound) {
         ASSERT_EQ(0, ::chmod((m_root + "/a").c_str(), 0));
         EXPECT_EQ(NotFound(), Ask("/a").text);
     }
+}
+
+TEST_F(OxResourceStaticFile, WithoutADescriptorLeftNoFileIsFound) {
+    Write("/plain", "plain");
+    Connection connection;
+    LineLog log;
+    oxRequest request;
+    connection.PeerSend("GET /plain HTTP/1.0\r\n\r\n");
+    ASSERT_TRUE(request.Read(connection.Server(), log) && request.Parse());
+    oxResource_StaticFile resource(m_root, false);
+    rlimit before{};
+    ASSERT_EQ(0, ::getrlimit(RLIMIT_NOFILE, &before));
+    UniqueFd next = OpenFile("/dev/null", O_RDONLY);
+    ASSERT_TRUE(next);
+    const rlimit full{.rlim_cur = static_cast<rlim_t>(next.Get()), .rlim_max = before.rlim_max};
+    next.Reset();
+    ASSERT_EQ(0, ::setrlimit(RLIMIT_NOFILE, &full));
+    const auto reply = resource.GetReply(request);
+    ASSERT_EQ(0, ::setrlimit(RLIMIT_NOFILE, &before));
+    EXPECT_EQ(NotFound(), reply->ComposeHeader());
+    EXPECT_EQ(0u, reply->GetContentSize());
+    EXPECT_EQ(&Http::OK_200, &resource.GetReply(request)->GetStatus());
 }
 
 TEST_F(OxResourceStaticFile, ContentSizeIsTheFilesSizeIn32Bits) {

@@ -170,6 +170,26 @@ TEST(DetachProcess, AnOrdinaryUserStaysWhoHeIs) {
               0);
 }
 
+TEST(DetachProcess, ASetUidPrivilegeIsDropped) {
+    if (getuid() != 0)
+        GTEST_SKIP() << "needs root";
+    EXPECT_EQ(RunInChild([] {
+                  constexpr uid_t USER = 1234;
+                  if (setresuid(USER, 0, 0) != 0)
+                      return 1;
+                  LinesAudit audit;
+                  oxDetachOptions options;
+                  options.changeDirectory = false;
+                  DetachProcess(options, ".", oxStartupConfig(), audit);
+                  uid_t real;
+                  uid_t effective;
+                  uid_t saved;
+                  getresuid(&real, &effective, &saved);
+                  return real == USER && effective == USER && saved == USER && audit.lines.empty() ? 0 : 2;
+              }),
+              0);
+}
+
 TEST(DetachProcess, RootTakesTheConfiguredIds) {
     if (getuid() != 0)
         GTEST_SKIP() << "needs root";

@@ -2,6 +2,7 @@
 
 #include <gtest/gtest.h>
 
+#include <cstdlib>
 #include <new>
 #include <stdexcept>
 #include <thread>
@@ -38,6 +39,20 @@ TEST(NewHandler, LogsAndThrows) {
                         _exit(9);
                     }),
               "Memory allocation failed.\n");
+}
+
+TEST(NewHandler, TheOneBeforeItComesBackAtExit) {
+    static const std::new_handler BEFORE = [] { throw std::bad_alloc(); };
+    EXPECT_EQ(LogOf(7,
+                    [] {
+                        std::set_new_handler(BEFORE);
+                        std::atexit([] { _exit(std::get_new_handler() == BEFORE ? 7 : 8); });
+                        InstallNewHandler();
+                        if (std::get_new_handler() == BEFORE)
+                            _exit(9);
+                        std::exit(10);
+                    }),
+              "");
 }
 
 TEST(TerminateHandler, AnUncaughtExceptionOfAThreadEndsTheProcess) {

@@ -164,6 +164,20 @@ TEST_F(OxPidFile, CannotBeOpened) {
                                   "1|Error: Unable to create lock file, " + nowhere.Path() + "."}));
 }
 
+TEST_F(OxPidFile, APipeHoldsNobodyUp) {
+    ASSERT_EQ(mkfifo(path.c_str(), 0600), 0);
+    EXPECT_EQ(RunInChild([this] {
+                  alarm(60);
+                  if (pidFile.Write(TITLE, 1))
+                      return 1;
+                  const Lines wanted{"Error: can't open pidfile " + path + ": No such device or address",
+                                     "1|Error: Unable to create lock file, " + path + "."};
+                  return audit.lines == wanted ? 0 : 2;
+              }),
+              0);
+    EXPECT_TRUE(std::filesystem::is_fifo(path));
+}
+
 TEST_F(OxPidFile, CannotBeWritten) {
     std::filesystem::create_symlink("/dev/full", path);
     EXPECT_FALSE(pidFile.Write(TITLE, 1));

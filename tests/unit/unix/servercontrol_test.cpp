@@ -5,6 +5,16 @@
 #include <netinet/in.h>
 #include <sys/socket.h>
 
+#include <algorithm>
+#include <atomic>
+#include <cerrno>
+#include <chrono>
+#include <thread>
+#include <vector>
+
+#include "net/socket.h"
+#include "testing/waiting.h"
+#include "unix/remoteconfig.h"
 #include "unix/testtools.h"
 #include "unix/theserver.h"
 
@@ -44,6 +54,31 @@ void WriteSettings(int port) {
 }
 }  // namespace
 
+// The first in this file: no other test may have built the server.
+TEST(TheServer, IsOneHoweverManyThreadsAskFirst) {
+    constexpr int THREADS = 16;
+    static std::atomic<int> s_answered;
+    s_answered = 0;
+    // The first socket of the server looks this machine up: that holds its building up while the others ask.
+    const auto lookUp = oxSocket::m_lpfngethostbyname;
+    oxSocket::m_lpfngethostbyname = [](const char*) -> hostent* {
+        Eventually([] { return s_answered == THREADS - 1; }, std::chrono::milliseconds(200));
+        return nullptr;
+    };
+    std::vector<const oxxHttpServer*> servers(THREADS, nullptr);
+    std::vector<std::thread> threads;
+    for (auto& server : servers)
+        threads.emplace_back([&server] {
+            server = &theServer();
+            ++s_answered;
+        });
+    for (std::thread& thread : threads)
+        thread.join();
+    oxSocket::m_lpfngethostbyname = lookUp;
+    EXPECT_NE(servers.front(), nullptr);
+    EXPECT_EQ(std::count(servers.begin(), servers.end(), servers.front()), THREADS);
+}
+
 TEST(OxTheServerControl, StartStatusAndStop) {
     const ScratchDirectory scratch;
     LinesAudit audit;
@@ -72,4 +107,40 @@ TEST(OxTheServerControl, StartStatusAndStop) {
     EXPECT_EQ(control.Start({}), 0) << "a running server counts as started";
     control.Stop();
     EXPECT_EQ(control.Status(port), -1);
+}
+
+TEST(OxTheServerControl, AListenerThatEndedByItselfIsAnErrorUntilAGoodStart) {
+    const ScratchDirectory scratch;
+    LinesAudit audit;
+    oxTheServerControl control(audit);
+    oxRemoteConfig remote(control);
+    int port = 0;
+    TakenPort own;
+    own.Release();
+    WriteSettings(own.Port());
+    const auto listens = oxSocket::m_lpfnlisten;
+    oxSocket::m_lpfnlisten = [](int, int) {
+        errno = EADDRINUSE;
+        return -1;
+    };
+    EXPECT_EQ(remote.Start({}), 0) << "only its thread notices";
+    EXPECT_TRUE(Eventually([&] { return control.Status(port) == -2; }));
+    oxSocket::m_lpfnlisten = listens;
+    EXPECT_EQ(remote.GetPort(), -1);
+
+    const TakenPort taken;
+    WriteSettings(taken.Port());
+    EXPECT_EQ(remote.Start({}), -1);
+    EXPECT_EQ(control.Status(port), -2);
+    EXPECT_EQ(remote.GetPort(), -1);
+    remote.Stop();
+    EXPECT_EQ(control.Status(port), -2) << "only what runs is stopped";
+
+    WriteSettings(own.Port());
+    EXPECT_EQ(remote.Start({}), 0);
+    EXPECT_EQ(control.Status(port), 0);
+    EXPECT_EQ(remote.GetPort(), own.Port());
+    remote.Stop();
+    EXPECT_EQ(control.Status(port), -1);
+    EXPECT_TRUE(audit.lines.empty());
 }

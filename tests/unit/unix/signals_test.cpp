@@ -5,6 +5,8 @@
 #include <cerrno>
 #include <vector>
 
+#include "testing/slots.h"
+#include "unix/remotesignals.h"
 #include "unix/testtools.h"
 
 namespace {
@@ -179,4 +181,14 @@ TEST(OxSignals, InstallsAnAsynchronousHandler) {
                   return 0;
               }),
               0);
+}
+
+// Programs that were built against an older library call by these places.
+TEST(OxSignals, VirtualOperationsFollowThoseOfTheThread) {
+    EXPECT_EQ(SlotOf(&oxSignals::SignalHandshake), 2U);
+    EXPECT_EQ(SlotOf(&oxSignals::WaitHandshake), 3U);
+    EXPECT_EQ(SlotOf(&oxSignals::WaitLoop), 4U);
+    EXPECT_EQ(SlotOf(&oxSignals::OnSignal), 5U);
+    EXPECT_EQ(SlotOf(&oxRemoteSignals::OnSignal), 5U);
+    EXPECT_EQ(SlotOf(&oxSignals::InstallHandler), 6U);
 }

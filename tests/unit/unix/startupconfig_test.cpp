@@ -64,6 +64,14 @@ TEST_F(OxStartupConfig, TextsAreCut) {
     EXPECT_EQ(config.ersAddress, std::string(4095, 'x'));
 }
 
+TEST_F(OxStartupConfig, PathsAreCutBeforeTheyAreNormalised) {
+    const std::string tail(5000, 'x');
+    Write("", "[Audit]\nlogfile=a//" + tail + "\nlogdir=./b//" + tail + "\n");
+    ASSERT_TRUE(Read());
+    EXPECT_EQ(config.logFile, "a/" + std::string(4095 - 3, 'x'));
+    EXPECT_EQ(config.logDir, "./b/" + std::string(4095 - 5, 'x'));
+}
+
 TEST_F(OxStartupConfig, ASecondReadingStartsFromTheFirst) {
     Write("", "[Audit]\ndebuglevel=9\nlogfile=mine\n");
     ASSERT_TRUE(Read());
@@ -79,6 +87,13 @@ TEST_F(OxStartupConfig, AMissingFileFailsWithALine) {
     audit.lines.clear();
     Write("", "");
     std::filesystem::remove("ox_remote.ini");
+    EXPECT_FALSE(Read());
+    EXPECT_EQ(audit.lines, Lines{"Warning: config file does not exist: ./ox_remote.ini."});
+    EXPECT_EQ(errors.Text(), "");
+}
+
+TEST_F(OxStartupConfig, BothFilesMustExistBeforeEitherIsLoaded) {
+    std::filesystem::create_directories(MAIN_FILE);  // would not load
     EXPECT_FALSE(Read());
     EXPECT_EQ(audit.lines, Lines{"Warning: config file does not exist: ./ox_remote.ini."});
     EXPECT_EQ(errors.Text(), "");

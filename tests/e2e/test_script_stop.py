@@ -92,6 +92,7 @@ def test_sixteen_scripts_run_at_once_and_the_seventeenth_waits(site):
     released = time.monotonic()
     wait_until(lambda: len(held(site)) == 17, "the seventeenth has its turn")
     assert time.monotonic() - released < 1 * SLOWDOWN
+    wait_until(lambda: pages, "the first page")
     assert pages == [f"./{first}"]
     for name in held(site):
         (site.root / "go." / name).touch()

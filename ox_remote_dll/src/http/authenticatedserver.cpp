@@ -119,7 +119,9 @@ oxAuthenticatedHttpServer::Memory oxAuthenticatedHttpServer::LookUp(const std::s
                                                                     std::uint32_t& permissions) {
     const std::scoped_lock lock(m_userLock);
     const auto found = m_users.find(name);
-    if (found == m_users.end() || !EqualSecrets(found->second.user->GetPassword(), password))
+    // One that is idle too long is as good as swept.
+    if (found == m_users.end() || found->second.user->IsExpired() ||
+        !EqualSecrets(found->second.user->GetPassword(), password))
         return Memory::None;
     // One that another request has checked against newer data than this request knows of is good too.
     if (found->second.generation < generation)

@@ -131,9 +131,10 @@ bool oxUserBase::AddUser(const std::string& name, const std::string& password, s
     const std::scoped_lock changing(m_changing);
     const oxUserDirectory::Lock directoryLock(m_directory);
     const std::scoped_lock lock(m_mutex);
-    // The first user of an installation makes the directory; users that cannot be listed might hold the name.
+    // The first user of an installation makes the directory; users that cannot be listed might hold the name. Where a
+    // file is in the way there are none, and making the directory tells.
     const int error = Reload();
-    if ((error != 0 && error != ENOENT) || HasFile(name))
+    if ((error != 0 && error != ENOENT && error != ENOTDIR) || HasFile(name))
         return false;
     if (!m_directory.Create()) {
         std::fputs("Couldn't create user config directory.\n", stderr);

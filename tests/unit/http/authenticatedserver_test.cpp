@@ -312,6 +312,24 @@ TEST_F(oxAuthenticatedHttpServerTest, SweepForgetsWhoWasIdleForLongerThanTheTime
     EXPECT_EQ(server->Checks(), Checks(3, 0)) << "checked again";
 }
 
+TEST_F(oxAuthenticatedHttpServerTest, LoginIdleForLongerThanTheTimeoutIsCheckedAgainBeforeTheSweepToo) {
+    oxUser::m_nTimeout = 30;
+    ASSERT_TRUE(server->Ask("alice", "ecila"));
+    clock.Advance(30);
+    EXPECT_TRUE(server->Ask("alice", "ecila"));
+    EXPECT_EQ(server->Checks(), Checks(1, 0)) << "exactly the time-out is not too long";
+    clock.Advance(31);
+    std::uint32_t permissions = 0;
+    EXPECT_FALSE(server->FindUser("alice", "ecila", permissions));
+    ++server->generation;
+    EXPECT_TRUE(server->Ask("alice", "ecila"));
+    EXPECT_EQ(server->Checks(), Checks(2, 0)) << "in full";
+    EXPECT_EQ(server->UserCount(), 1u);
+    clock.Advance(30);
+    EXPECT_TRUE(server->Ask("alice", "ecila"));
+    EXPECT_EQ(server->Checks(), Checks(2, 0)) << "remembered anew";
+}
+
 // Logins, changes, sweeps and removals all at once: nobody is refused, and what is remembered is never wrong.
 TEST_F(oxAuthenticatedHttpServerTest, ManyThreadsAtOnce) {
     constexpr int THREADS = 8;

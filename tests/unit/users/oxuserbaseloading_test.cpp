@@ -259,6 +259,15 @@ TEST_F(oxUserBaseLoading, ADirectoryThatCannotBeMadeIsReported) {
         EXPECT_FALSE(users.LoadAll());
         EXPECT_EQ("", ListOf(users));
     }
+    for (const char* path : {"file", "file/users"}) {
+        oxUserBase users(m_scratch.File(path));
+        bool added = true;
+        EXPECT_EQ("Couldn't create user config directory.\n",
+                  StandardErrorOf([&] { added = users.AddUser("alice", "secret", 1, "", ""); }));
+        EXPECT_FALSE(added);
+        EXPECT_EQ("", ListOf(users));
+    }
+    EXPECT_EQ("in the way", m_scratch.Read("file"));
     ASSERT_EQ(0, chmod(m_scratch.Path().c_str(), 0555));
     AsOrdinaryUser([&] {
         oxUserBase users(m_scratch.File("none/users"));

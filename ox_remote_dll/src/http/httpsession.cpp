@@ -69,11 +69,6 @@ void oxHttpSession::Abort() {
             m_state = STATE_CLOSING;
     }
     m_stopFlag = true;
-    CloseSocket();
-}
-
-void oxHttpSession::CloseSocket() {
-    const std::scoped_lock lock(m_mutex);
     m_socket.Close();
 }
 
@@ -161,7 +156,7 @@ void oxHttpSession::CloseConnection(const oxRequest& request) {
         if (!request.IsComplete() || m_socket.Recv(&next, 1, MSG_DONTWAIT) > 0)
             DropUnread();
     }
-    CloseSocket();
+    m_socket.Close();
     m_reply.reset();
     m_resource.reset();
 }

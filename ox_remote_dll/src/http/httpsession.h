@@ -60,7 +60,6 @@ public:
 private:
     static void* CallSessionThread(void* session);
     void Abort();
-    void CloseSocket();
     void Serve();
     void ServeRequest(oxRequest& request);
     std::unique_ptr<oxReply> ChooseReply(const oxRequest& request);
@@ -76,7 +75,7 @@ private:
     std::atomic<bool> m_active{true};
     bool m_stopped = false;
     std::atomic<bool> m_stopFlag{false};  // what the resource looks at while it waits
-    MMutex m_mutex;  // guards changes of the state and the closing of the socket; never held over a call that may wait
+    MMutex m_mutex;  // guards the changes of the state; never held over closing the socket, which may wait
     std::unique_ptr<oxResource> m_resource;
     std::unique_ptr<oxReply> m_reply;
 };

@@ -112,7 +112,5 @@ void oxReply::ApplyMetaHeader(std::string_view name, std::string_view value) {
         return;
     m_contentTypeOverride = value.substr(0, end);
     // A line break in it would let a page add headers of its own.
-    std::replace_if(
-        m_contentTypeOverride.begin(), m_contentTypeOverride.end(), [](char c) { return c != '\t' && IsControl(c); },
-        ' ');
+    std::replace_if(m_contentTypeOverride.begin(), m_contentTypeOverride.end(), IsControl, ' ');
 }

@@ -20,6 +20,8 @@ int oxRemoteConfig::Start(const oxServerArguments& arguments) {
     oxServerArguments full = arguments;
     full.baseDirectory = FullName(arguments.baseDirectory);
     full.documentRoot = FullName(arguments.documentRoot);
+    // Also a failed start may have begun something that a stop has to end.
+    m_started = true;
     const int result = m_server.Start(full);
     if (result == START_GOOD)
         m_server.Status(m_port);
@@ -27,6 +29,9 @@ int oxRemoteConfig::Start(const oxServerArguments& arguments) {
 }
 
 void oxRemoteConfig::Stop() {
+    if (!m_started)
+        return;
+    m_started = false;
     m_server.Stop();
 }
 

@@ -5,7 +5,7 @@
 
 #include "unix/servercontrol.h"
 
-// The destructor stops the server, whoever started it; a stopped one stays as it is.
+// The destructor stops the server, if this object started it.
 class oxRemoteConfig : public oxServerControl {
 public:
     static constexpr int DEFAULT_PORT = 80;
@@ -30,4 +30,5 @@ private:
     oxServerControl& m_server;
     int m_port = DEFAULT_PORT;
     [[maybe_unused]] std::uint32_t m_reserved[4] = {};  // kept; nothing reads them
+    bool m_started = false;
 };

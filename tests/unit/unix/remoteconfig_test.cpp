@@ -9,18 +9,24 @@ namespace {
 using Texts = std::vector<std::string>;
 }
 
-TEST(OxRemoteConfig, ItsEndStopsTheServer) {
+TEST(OxRemoteConfig, StopsOnlyWhatItStarted) {
     FakeControl server;
     { oxRemoteConfig config(server); }
-    EXPECT_EQ(server.calls, Texts{"stop"});
+    EXPECT_EQ(server.calls, Texts{});
+    { oxRemoteConfig(server).Stop(); }
+    EXPECT_EQ(server.calls, Texts{});
+    {
+        oxRemoteConfig config(server);
+        config.Start({});
+    }
+    EXPECT_EQ(server.calls, (Texts{"start", "stop"}));
     server.calls.clear();
     {
         oxRemoteConfig config(server);
         config.Start({});
         config.Stop();
-        EXPECT_EQ(server.calls, (Texts{"start", "stop"}));
     }
-    EXPECT_EQ(server.calls, (Texts{"start", "stop", "stop"}));
+    EXPECT_EQ(server.calls, (Texts{"start", "stop"}));
 }
 
 TEST(OxRemoteConfig, DirectoriesThatBeginWithADotAreMadeAbsolute) {

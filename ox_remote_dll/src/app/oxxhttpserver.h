@@ -12,13 +12,12 @@
 #include "app/appsetup.h"
 #include "app/profilemap.h"
 #include "app/scriptingserver.h"
+#include "app/urlpath.h"
 #include "http/loginlockout.h"
 #include "net/socket.h"
 #include "platform/mutex.h"
 #include "users/osuserbase.h"
 #include "users/oxuserbase.h"
-
-class oxUrlPath;
 
 // Routes each URL to a file, a report or a script under the access rules that go with it, decides who a user is and
 // what they may see, and carries out the commands of scripts.
@@ -48,7 +47,7 @@ public:
     static constexpr const char* sINI_SECTION_DEFAULTS = "defaults";
     static constexpr const char* sINI_ERS_TIMEOUT = "ErsTimeout";
     static constexpr const char* sINI_ERS_RETRIES = "ErsRetries";
-    static constexpr const char* sDOT_DOT_SLASH = "../";
+    static constexpr const char* sDOT_DOT_SLASH = oxUrlPath::CLIMB;
     // Without a closing quote on purpose: browsers have remembered passwords under this realm for years.
     static constexpr const char* sAUTHENTICATION_REALM_STRING =
         "WWW-Authenticate: Basic realm=\"Orvex Reporting Server\r\n";

@@ -2,11 +2,10 @@
 
 #include <algorithm>
 
-#include "app/oxxhttpserver.h"
 #include "platform/text.h"
 
 bool oxUrlPath::Climbs() const {
-    return m_path.find(oxxHttpServer::sDOT_DOT_SLASH) != std::string_view::npos;
+    return m_path.find(CLIMB) != std::string_view::npos;
 }
 
 bool oxUrlPath::BeginsWith(std::string_view component) const {

@@ -10,7 +10,9 @@ class oxUrlPath {
 public:
     explicit oxUrlPath(std::string_view path) : m_path(path) {}
 
-    // "../" anywhere.
+    static constexpr const char* CLIMB = "../";
+
+    // CLIMB anywhere.
     bool Climbs() const;
     // Whether the first component is this one.
     bool BeginsWith(std::string_view component) const;

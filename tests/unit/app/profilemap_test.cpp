@@ -2,7 +2,6 @@
 
 #include <gtest/gtest.h>
 #include <sys/stat.h>
-#include <sys/syscall.h>
 #include <unistd.h>
 
 #include <atomic>
@@ -12,6 +11,7 @@
 #include <thread>
 #include <vector>
 
+#include "platform/identitycalls.h"
 #include "testing/scratch.h"
 
 using namespace std::string_literals;
@@ -362,13 +362,7 @@ TEST_F(oxxProfileMapTest, FileWithoutReadPermissionKeepsItsEntries) {
     ASSERT_EQ(chmod(dir.File("sales.wlp").c_str(), 0), 0);
     std::thread([this] {
         constexpr uid_t NOBODY = 65534;
-        constexpr uid_t UNCHANGED = static_cast<uid_t>(-1);
-#ifdef SYS_setresuid32
-        constexpr long SET_IDS_CALL = SYS_setresuid32;
-#else
-        constexpr long SET_IDS_CALL = SYS_setresuid;
-#endif
-        ASSERT_TRUE(geteuid() != 0 || syscall(SET_IDS_CALL, UNCHANGED, NOBODY, UNCHANGED) == 0);
+        ASSERT_TRUE(geteuid() != 0 || syscall(SET_USERS_CALL, UNCHANGED_USER, NOBODY, UNCHANGED_USER) == 0);
         ASSERT_FALSE(std::ifstream(dir.File("sales.wlp")).is_open());
         map.Refresh("sales.wlp");
         Load();

@@ -15,6 +15,7 @@
 #include "app/appfixture.h"
 #include "app/fakeservice.h"
 #include "testing/client.h"
+#include "testing/injected.h"
 #include "testing/waiting.h"
 
 namespace {
@@ -38,20 +39,6 @@ std::string Disconnected(int error) {
 std::string ConnectFailed(int error, const std::string& text) {
     return "oxxHttpServer::SendERSRequest : connect failed - socket error = " + std::to_string(error) + " " + text;
 }
-
-// Puts a table entry back.
-template <typename Function>
-class Replaced {
-public:
-    Replaced(Function& entry, Function with) : m_entry(entry), m_before(entry) { entry = with; }
-    ~Replaced() { m_entry = m_before; }
-    Replaced(const Replaced&) = delete;
-    Replaced& operator=(const Replaced&) = delete;
-
-private:
-    Function& m_entry;
-    const Function m_before;
-};
 
 class RemoteService : public AppFixture {
 protected:
@@ -260,7 +247,7 @@ TEST_F(RemoteService, ResetIsReportedAsSuch) {
 
 TEST_F(RemoteService, OtherErrorsOfReceiving) {
     static int s_error = 0;
-    const Replaced recv(
+    const Injected recv(
         oxSocket::m_lpfnrecv, +[](int, void*, std::size_t, int) -> ssize_t {
             errno = s_error;
             return -1;
@@ -302,7 +289,7 @@ TEST_F(RemoteService, AddressThatIsNoneIsAFailedConnect) {
 }
 
 TEST_F(RemoteService, HostThatIsNotFoundIsAFailedConnect) {
-    const Replaced noHosts(
+    const Injected noHosts(
         oxSocket::m_lpfngethostbyname, +[](const char*) -> hostent* { return nullptr; });
     UseService("no-such-host:8080");
     EXPECT_EQ("-256|", Ask());
@@ -311,7 +298,7 @@ TEST_F(RemoteService, HostThatIsNotFoundIsAFailedConnect) {
 }
 
 TEST_F(RemoteService, HostIsLookedUpByName) {
-    const Replaced hosts(
+    const Injected hosts(
         oxSocket::m_lpfngethostbyname, +[](const char* name) -> hostent* {
             static char s_address[4] = {127, 0, 0, 1};
             static char* s_list[] = {s_address, nullptr};
@@ -325,7 +312,7 @@ TEST_F(RemoteService, HostIsLookedUpByName) {
 }
 
 TEST_F(RemoteService, OwnNameThatIsNotFoundIsThisMachineAllTheSame) {
-    const Replaced noHosts(
+    const Injected noHosts(
         oxSocket::m_lpfngethostbyname, +[](const char*) -> hostent* { return nullptr; });
     FakeService service("0|done|EOT");
     UseService(std::to_string(service.Port()));
@@ -333,7 +320,7 @@ TEST_F(RemoteService, OwnNameThatIsNotFoundIsThisMachineAllTheSame) {
 }
 
 TEST_F(RemoteService, SocketThatCannotBeMadeIsAFailedConnect) {
-    const Replaced noSockets(
+    const Injected noSockets(
         oxSocket::m_lpfnsocket, +[](int, int, int) {
             errno = EMFILE;
             return -1;
@@ -374,7 +361,7 @@ TEST_F(RemoteService, ConnectionSendsAtOnceAndMayReuseItsAddress) {
     static int s_noDelay = 0;
     static int s_reuse = 0;
     s_noDelay = s_reuse = 0;
-    const Replaced connect(
+    const Injected connect(
         oxSocket::m_lpfnconnect, +[](int socket, const sockaddr* address, socklen_t length) {
             socklen_t size = sizeof s_noDelay;
             EXPECT_EQ(0, ::getsockopt(socket, IPPROTO_TCP, TCP_NODELAY, &s_noDelay, &size));
@@ -406,7 +393,7 @@ TEST_F(RemoteService, AnyDescriptorNumberWorks) {
     const rlimit raised{.rlim_cur = std::max<rlim_t>(before.rlim_cur, HIGH + 1), .rlim_max = before.rlim_max};
     ASSERT_EQ(0, ::setrlimit(RLIMIT_NOFILE, &raised));
     {
-        const Replaced high(
+        const Injected high(
             oxSocket::m_lpfnsocket, +[](int family, int type, int protocol) {
                 const UniqueFd low(::socket(family, type, protocol));
                 return ::fcntl(low.Get(), F_DUPFD_CLOEXEC, HIGH);

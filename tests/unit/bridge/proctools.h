@@ -2,7 +2,6 @@
 #pragma once
 
 #include <fcntl.h>
-#include <sys/syscall.h>
 #include <sys/wait.h>
 #include <unistd.h>
 
@@ -19,6 +18,7 @@
 #include <string>
 
 #include "platform/file.h"
+#include "platform/identitycalls.h"
 #include "proc.h"
 #include "testing/waiting.h"
 
@@ -138,16 +138,6 @@ inline int InForkedCopy(const std::function<int()>& function) {
     }
     return WIFEXITED(status) ? WEXITSTATUS(status) : 1000 + WTERMSIG(status);
 }
-
-#ifdef SYS_setresuid32
-inline constexpr long SET_USERS_CALL = SYS_setresuid32;
-inline constexpr long SET_GROUPS_CALL = SYS_setresgid32;
-inline constexpr long SET_GROUP_LIST_CALL = SYS_setgroups32;
-#else
-inline constexpr long SET_USERS_CALL = SYS_setresuid;
-inline constexpr long SET_GROUPS_CALL = SYS_setresgid;
-inline constexpr long SET_GROUP_LIST_CALL = SYS_setgroups;
-#endif
 
 inline bool IsRoot() {
     return getuid() == 0 && geteuid() == 0;

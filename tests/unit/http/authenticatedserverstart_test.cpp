@@ -1,6 +1,5 @@
 // Starting and stopping the server and its time-out thread.
 #include <sys/stat.h>
-#include <sys/syscall.h>
 #include <unistd.h>
 
 #include <atomic>
@@ -13,6 +12,7 @@
 
 #include "http/authenticatedfixture.h"
 #include "http/support_threads.h"
+#include "platform/identitycalls.h"
 
 namespace {
 
@@ -21,17 +21,11 @@ using Checks = std::pair<int, int>;
 
 constexpr const char* ROOT_LINE = "O/S authentication requires starting the program with root access.";
 
-#ifdef SYS_setresuid32
-constexpr long SET_IDS_CALL = SYS_setresuid32;
-#else
-constexpr long SET_IDS_CALL = SYS_setresuid;
-#endif
-
 // Runs the body on a thread of its own that cannot become root, whoever runs the tests.
 void WithoutRoot(const std::function<void()>& body) {
     std::thread([&] {
         constexpr uid_t NOBODY = 65534;
-        ASSERT_TRUE(geteuid() != 0 || syscall(SET_IDS_CALL, NOBODY, NOBODY, NOBODY) == 0);
+        ASSERT_TRUE(geteuid() != 0 || syscall(SET_USERS_CALL, NOBODY, NOBODY, NOBODY) == 0);
         body();
     }).join();
 }
@@ -254,9 +248,8 @@ TEST_F(AuthenticatedServerStart, OSAuthenticationStartsWithRoot) {
     // As a daemon that gave root up for its effective user only.
     std::thread([this] {
         constexpr uid_t DAEMON = 1;
-        constexpr uid_t UNCHANGED = static_cast<uid_t>(-1);
         ASSERT_EQ(chmod(dir.Path().c_str(), 0777), 0);
-        ASSERT_EQ(syscall(SET_IDS_CALL, UNCHANGED, DAEMON, UNCHANGED), 0);
+        ASSERT_EQ(syscall(SET_USERS_CALL, UNCHANGED_USER, DAEMON, UNCHANGED_USER), 0);
         EXPECT_TRUE(server->StartAuthenticated(true));
         EXPECT_EQ(geteuid(), DAEMON) << "only tried";
         server->Stop();

@@ -10,9 +10,9 @@
 #include <new>
 #include <thread>
 
-#include "http/injected.h"
 #include "http/serverfixture.h"
 #include "http/support_threads.h"
+#include "testing/injected.h"
 
 namespace {
 

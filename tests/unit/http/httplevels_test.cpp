@@ -3,8 +3,8 @@
 #include <filesystem>
 #include <thread>
 
-#include "http/injected.h"
 #include "http/serverfixture.h"
+#include "testing/injected.h"
 
 namespace {
 

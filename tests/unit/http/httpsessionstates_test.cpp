@@ -6,9 +6,9 @@
 #include <thread>
 
 #include "http/httpsession.h"
-#include "http/injected.h"
 #include "http/serverfixture.h"
 #include "http/support_threads.h"
+#include "testing/injected.h"
 
 namespace {
 

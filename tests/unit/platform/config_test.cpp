@@ -2,12 +2,12 @@
 
 #include <gtest/gtest.h>
 #include <sys/stat.h>
-#include <sys/syscall.h>
 #include <unistd.h>
 
 #include <climits>
 #include <thread>
 
+#include "testing/ordinaryuser.h"
 #include "testing/scratch.h"
 
 using namespace std::string_literals;
@@ -222,17 +222,12 @@ TEST(oxConfig, FileWithoutPermissionDoesNotLoad) {
     const Scratch directory;
     directory.Write("closed.ini", "[s]\nk=v\n");
     ASSERT_EQ(0, chmod((directory.File("closed.ini")).c_str(), 0));
-    // Root reads everything, so its part is played by a thread that is root no more.
-    std::thread([&] {
-        if (geteuid() == 0) {
-            constexpr uid_t ORDINARY_USER = 1;
-            ASSERT_EQ(0, syscall(SYS_setresuid, ORDINARY_USER, ORDINARY_USER, ORDINARY_USER));
-        }
+    AsOrdinaryUser([&] {
         oxConfig config;
         EXPECT_FALSE(config.Open(directory.File("closed.ini")));
         EXPECT_FALSE(config.IsOpen());
         EXPECT_EQ("Permission denied", config.ErrorText());
-    }).join();
+    });
 }
 
 TEST(oxConfig, PutsAndRemoves) {

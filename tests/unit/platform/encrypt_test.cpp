@@ -3,7 +3,6 @@
 #include <fcntl.h>
 #include <gtest/gtest.h>
 #include <sys/stat.h>
-#include <sys/syscall.h>
 #include <sys/wait.h>
 #include <unistd.h>
 
@@ -17,6 +16,7 @@
 #include <vector>
 
 #include "platform/file.h"
+#include "testing/ordinaryuser.h"
 #include "testing/scratch.h"
 
 using namespace std::string_literals;
@@ -59,18 +59,6 @@ void ExpectOpens(const std::string& clear, std::string_view sealed) {
     std::string opened = "what stood here before";
     EXPECT_TRUE(oxDecrypt(sealed, opened));
     EXPECT_EQ(clear, opened);
-}
-
-// Runs as somebody whom file modes hold back.
-template <typename Body>
-void AsOrdinaryUser(const Body& body) {
-    std::thread([&] {
-        if (geteuid() == 0) {
-            constexpr uid_t ORDINARY_USER = 1;
-            ASSERT_EQ(0, syscall(SYS_setresuid, ORDINARY_USER, ORDINARY_USER, ORDINARY_USER));
-        }
-        body();
-    }).join();
 }
 
 }  // namespace

@@ -1,7 +1,6 @@
 #include "platform/rootguard.h"
 
 #include <gtest/gtest.h>
-#include <sys/syscall.h>
 #include <sys/wait.h>
 #include <unistd.h>
 
@@ -11,22 +10,17 @@
 #include <thread>
 #include <vector>
 
+#include "platform/identitycalls.h"
+
 namespace {
 
 constexpr uid_t ORDINARY_USER = 1;
-constexpr uid_t UNCHANGED = static_cast<uid_t>(-1);
-
-#ifdef SYS_setresuid32
-constexpr long SET_IDS_CALL = SYS_setresuid32;
-#else
-constexpr long SET_IDS_CALL = SYS_setresuid;
-#endif
 
 // Runs the body on a thread of its own whose effective user is the ordinary one; the rest of the process is not
 // touched, and threads that the body starts inherit the user.
 void AsOrdinaryUser(const std::function<void()>& body) {
     std::thread([&] {
-        ASSERT_EQ(0, syscall(SET_IDS_CALL, UNCHANGED, ORDINARY_USER, UNCHANGED));
+        ASSERT_EQ(0, syscall(SET_USERS_CALL, UNCHANGED_USER, ORDINARY_USER, UNCHANGED_USER));
         ASSERT_EQ(ORDINARY_USER, geteuid());
         body();
     }).join();
@@ -140,7 +134,7 @@ TEST(RootGuard, WhereRootIsOutOfReachNothingChanges) {
     // A thread that has given up root for good, or the ordinary user who runs the tests.
     std::thread([] {
         if (IsRoot()) {
-            ASSERT_EQ(0, syscall(SET_IDS_CALL, ORDINARY_USER, ORDINARY_USER, ORDINARY_USER));
+            ASSERT_EQ(0, syscall(SET_USERS_CALL, ORDINARY_USER, ORDINARY_USER, ORDINARY_USER));
         }
         const uid_t user = geteuid();
         ASSERT_NE(0u, user);
@@ -160,7 +154,7 @@ TEST(RootGuardDeathTest, AFailedRestoreEndsTheProcess) {
     EXPECT_DEATH(AsOrdinaryUser([] {
                      const RootGuard guard;
                      // No real or saved id to go back to, and no right to choose one: an ordinary user after all.
-                     syscall(SET_IDS_CALL, 2, 2, 2);
+                     syscall(SET_USERS_CALL, 2, 2, 2);
                  }),
                  "A thread could not give up the root identity\\.");
 }

@@ -18,6 +18,19 @@ bool IsNull(int descriptor) {
 std::string Ids(const char* kind, unsigned real, unsigned effective) {
     return std::string("7|") + kind + "id=" + std::to_string(real) + " e" + kind + "id=" + std::to_string(effective);
 }
+
+// Detaches as it is and says nothing; whether all three ids are this user's then.
+bool IsWhollyAfterDetaching(uid_t user) {
+    LinesAudit audit;
+    oxDetachOptions options;
+    options.changeDirectory = false;
+    DetachProcess(options, ".", oxStartupConfig(), audit);
+    uid_t real;
+    uid_t effective;
+    uid_t saved;
+    getresuid(&real, &effective, &saved);
+    return real == user && effective == user && saved == user && audit.lines.empty();
+}
 }  // namespace
 
 // In a child: puts one open file on the three standard descriptors; its own, above them.
@@ -157,15 +170,7 @@ TEST(DetachProcess, AnOrdinaryUserStaysWhoHeIs) {
                   const uid_t user = getuid() == 0 ? 1234 : getuid();
                   if (getuid() == 0 && setresuid(user, user, user) != 0)
                       return 1;
-                  LinesAudit audit;
-                  oxDetachOptions options;
-                  options.changeDirectory = false;
-                  DetachProcess(options, ".", oxStartupConfig(), audit);
-                  uid_t real;
-                  uid_t effective;
-                  uid_t saved;
-                  getresuid(&real, &effective, &saved);
-                  return real == user && effective == user && saved == user && audit.lines.empty() ? 0 : 2;
+                  return IsWhollyAfterDetaching(user) ? 0 : 2;
               }),
               0);
 }
@@ -177,15 +182,7 @@ TEST(DetachProcess, ASetUidPrivilegeIsDropped) {
                   constexpr uid_t USER = 1234;
                   if (setresuid(USER, 0, 0) != 0)
                       return 1;
-                  LinesAudit audit;
-                  oxDetachOptions options;
-                  options.changeDirectory = false;
-                  DetachProcess(options, ".", oxStartupConfig(), audit);
-                  uid_t real;
-                  uid_t effective;
-                  uid_t saved;
-                  getresuid(&real, &effective, &saved);
-                  return real == USER && effective == USER && saved == USER && audit.lines.empty() ? 0 : 2;
+                  return IsWhollyAfterDetaching(USER) ? 0 : 2;
               }),
               0);
 }

@@ -2,7 +2,6 @@
 
 #include <grp.h>
 #include <gtest/gtest.h>
-#include <sys/syscall.h>
 #include <unistd.h>
 
 #include <cerrno>
@@ -10,17 +9,12 @@
 #include <thread>
 #include <vector>
 
+#include "platform/identitycalls.h"
 #include "users/support_accounts.h"
 
 namespace {
 
 using Groups = std::vector<gid_t>;
-
-#ifdef SYS_setgroups32
-constexpr long SET_GROUPS_CALL = SYS_setgroups32;
-#else
-constexpr long SET_GROUPS_CALL = SYS_setgroups;
-#endif
 
 Groups Now() {
     Groups groups(static_cast<std::size_t>(getgroups(0, nullptr)));
@@ -33,7 +27,7 @@ template <typename Body>
 void OnAThread(const Body& body) {
     std::thread([&] {
         const Groups start{1, 2};
-        ASSERT_EQ(0, syscall(SET_GROUPS_CALL, start.size(), start.data()));
+        ASSERT_EQ(0, syscall(SET_GROUP_LIST_CALL, start.size(), start.data()));
         body();
     }).join();
 }

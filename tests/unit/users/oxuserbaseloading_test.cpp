@@ -1,13 +1,13 @@
 #include <gtest/gtest.h>
 #include <sys/resource.h>
 #include <sys/stat.h>
-#include <sys/syscall.h>
 #include <unistd.h>
 
 #include <string>
 #include <thread>
 #include <vector>
 
+#include "testing/ordinaryuser.h"
 #include "testing/waiting.h"
 #include "userbasefixture.h"
 #include "users/oxuserbase.h"
@@ -19,18 +19,6 @@ namespace {
 using List = std::vector<std::string>;
 
 class oxUserBaseLoading : public UserBaseTest {};
-
-// Runs as somebody whom file modes hold back; root's part is played by a thread that is root no more.
-template <typename Body>
-void AsOrdinaryUser(const Body& body) {
-    std::thread([&] {
-        if (geteuid() == 0) {
-            constexpr uid_t ORDINARY_USER = 1;
-            ASSERT_EQ(0, syscall(SYS_setresuid, ORDINARY_USER, ORDINARY_USER, ORDINARY_USER));
-        }
-        body();
-    }).join();
-}
 
 }  // namespace
 

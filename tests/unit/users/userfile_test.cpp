@@ -2,15 +2,14 @@
 
 #include <gtest/gtest.h>
 #include <sys/stat.h>
-#include <sys/syscall.h>
 #include <unistd.h>
 
 #include <string>
 #include <string_view>
-#include <thread>
 
 #include "platform/config.h"
 #include "platform/encrypt.h"
+#include "testing/ordinaryuser.h"
 #include "testing/scratch.h"
 #include "testing/waiting.h"
 
@@ -274,11 +273,7 @@ TEST_F(UserFile, WhatCannotBeReadSaysWhy) {
     };
     constexpr Case CASES[] = {
         {"missing.usr", ENOENT}, {"pipe.usr", EINVAL}, {"directory.usr", EISDIR}, {"closed.usr", EACCES}};
-    std::thread([&] {
-        if (geteuid() == 0) {
-            constexpr uid_t ORDINARY_USER = 1;
-            ASSERT_EQ(0, syscall(SYS_setresuid, ORDINARY_USER, ORDINARY_USER, ORDINARY_USER));
-        }
+    AsOrdinaryUser([&] {
         for (const Case& c : CASES) {
             std::string text = "old";
             oxFileStamp stamp;
@@ -288,7 +283,7 @@ TEST_F(UserFile, WhatCannotBeReadSaysWhy) {
             EXPECT_TRUE(error == c.error || (error == EACCES && c.error != ENOENT)) << c.name << " " << error;
             EXPECT_EQ("", text);
         }
-    }).join();
+    });
     std::string text;
     oxFileStamp stamp;
     bool certain = false;

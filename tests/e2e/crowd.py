@@ -11,7 +11,7 @@ import time
 import traceback
 from urllib.parse import parse_qs
 
-from engines import check_page, script, use_player
+from engines import check_page, remote_request, script, use_player
 from harness import REPLY_403, SLOWDOWN, Background, basic, request_text
 
 WORKERS = 24
@@ -61,11 +61,8 @@ class Answering(socketserver.StreamRequestHandler):
     disable_nagle_algorithm = True
 
     def handle(self):
-        request = b""
-        while not request.endswith(b"|EOT"):
-            block = self.request.recv(4096)
-            assert block, f"the server left after {request!r}"
-            request += block
+        request = remote_request(self.request)
+        assert request, "the server left before its request was whole"
         context, command, argument, _ = request.decode().split("|")
         status, text = remote_answer(context, command, argument)
         self.server.answer(self.request, parse_qs(argument)["how"][0], f"{status}|{text}|EOT".encode())

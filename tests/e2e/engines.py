@@ -78,6 +78,17 @@ def script(site, name, text):
     return site.page(name, text.encode() if isinstance(text, str) else text)
 
 
+def remote_request(connection):
+    """What the server asks the remote service on this connection; nothing when it leaves before the end."""
+    request = b""
+    while not request.endswith(b"|EOT"):
+        block = connection.recv(4096)
+        if not block:
+            return b""
+        request += block
+    return request
+
+
 def no_remote_service(site):
     """Switches off the remote service, which gets the commands that this server does not know."""
     site.main_ini.write_text(site.main_ini.read_text().replace("ersaddress=127.0.0.1:1", "ersaddress="))

@@ -8,7 +8,7 @@ import time
 
 import pytest
 
-from engines import call, use_steps
+from engines import call, remote_request, use_steps
 from harness import SLOWDOWN, wait_until
 
 UNREACHABLE = -9
@@ -42,13 +42,7 @@ class Service:
     def _serve(self, connection):
         with connection:
             connection.setsockopt(socket.IPPROTO_TCP, socket.TCP_NODELAY, 1)
-            request = b""
-            while not request.endswith(b"|EOT"):
-                block = connection.recv(4096)
-                if not block:
-                    break
-                request += block
-            self.requests.append(request)
+            self.requests.append(remote_request(connection))
             with contextlib.suppress(OSError):
                 self.answer(connection)
                 while connection.fileno() >= 0 and connection.recv(4096):

@@ -9,7 +9,7 @@ import threading
 import pytest
 
 from conftest import needs_root
-from engines import call, no_remote_service, script, take_steps, use_steps
+from engines import call, no_remote_service, remote_request, script, take_steps, use_steps
 from harness import REPLY_401, basic, mode_of, request_text
 
 ADD, DELETE, LIST, CHANGE, GET = 20, 21, 22, 23, 24
@@ -385,10 +385,7 @@ def test_the_remote_service_gets_the_context_and_answers(site):
         for answer in (b"0|done|EOT", b"42||EOT", b"-7|x|EOT"):
             connection, _ = listener.accept()
             with connection:
-                data = b""
-                while not data.endswith(b"|EOT"):
-                    data += connection.recv(4096)
-                requests.append(data)
+                requests.append(remote_request(connection))
                 connection.sendall(answer)
 
     thread = threading.Thread(target=serve, daemon=True)
